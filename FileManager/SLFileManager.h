@@ -1,0 +1,97 @@
+// SLFileManager: the file-system layer that every other part of the system
+// goes through.
+//
+// It works at the level of POSIX calls, not through a high-level file API, so
+// that each failure carries the exact errno and a message naming the call that
+// failed. Every operation follows the same conventions:
+//
+//  - An operation that can fail returns a success flag, or a result that is
+//    absent on failure, and takes an optional error out-slot (sl::Error*) as
+//    its last argument. The slot may be null; when it is not, it is written
+//    only when the operation fails. On success it is left as the caller set
+//    it, and a result is defined only on success.
+//  - A record's "FunctionName" is the operation's documented name, e.g.
+//    "-[SLFileManager removeItemAtURL:error:]", and its "SourceFileLine" the
+//    line of the site that made it (Support/Errors.h).
+//  - When a system call fails, the record is in sl::kPOSIXErrorDomain with
+//    the call's errno (or the error number it returned) as the code, and the
+//    message names the call: "removefile of %@ failed: %s". Failures that the
+//    layer's own checks detect use SLInstallerErrorDomain with the codes of
+//    Support/Errors.h.
+//  - Diagnostics go to the installer log (Support/Log.h, threshold rule
+//    applied) under the operation's documented name. Per-entry callbacks log
+//    under the name of the operation that owns them, except the removal's
+//    error callback, which logs as "_removefile_error_callback".
+//  - In messages "%@" prints a URL as its URL string, "%s" a file-system path
+//    or a strerror text.
+//  - Symbolic links are never followed where the link could be the item
+//    itself.
+//
+// The class has no instance state: one shared instance per process, made on
+// first use and never destroyed. Operations keep nothing between calls, so
+// any thread may call any of them at any time.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <vector>
+
+#include "Platform/Error.h"
+#include "Platform/URL.h"
+
+class SLFileManager {
+ public:
+  // The shared instance; created once, thread-safely, on the first call.
+  static SLFileManager& defaultManager();
+
+  SLFileManager(const SLFileManager&) = delete;
+  SLFileManager& operator=(const SLFileManager&) = delete;
+
+  // Removes a file, a symbolic link (never its target) or a whole directory
+  // tree. An item that is already gone counts as removed; so does an entry
+  // that vanishes while the tree is being removed. A failed removal may have
+  // removed part of the tree; nothing is restored. A null URL fails with
+  // EFAULT.
+  [[nodiscard]] bool removeItemAtURL(const sl::URL& url, sl::Error* error = nullptr);
+
+  // The URLs of the directory's immediate children ("." and ".." left out),
+  // in the order the directory stream yields them. A child directory's URL
+  // is a directory URL; every other entry's (links included) is not. With
+  // ignoringSymlinks, links are left out, each with a notice line. The
+  // directory itself is opened without following a link: a path that is a
+  // link, or not a directory, fails.
+  std::optional<std::vector<sl::URL>> urlsForItemsInDirectoryAtURL(const sl::URL& url, bool ignoringSymlinks,
+                                                                   sl::Error* error = nullptr);
+
+  // Both tests lstat the path, so a dangling link counts as an item. They
+  // are not each other's negation: when the state of the path cannot be
+  // determined (anything but success or ENOENT) both answer false and log
+  // one error line. Ask itemDoesNotExistAtURL to be sure a path is free, and
+  // itemExistsAtURL to be sure something is there.
+  bool itemExistsAtURL(const sl::URL& url);
+  bool itemDoesNotExistAtURL(const sl::URL& url);
+
+ private:
+  SLFileManager() = default;
+
+  // One entry as the directory stream yields it. `name` is `nameLength`
+  // bytes (NUL-terminated too); `type` is DT_UNKNOWN, DT_DIR, DT_REG, DT_LNK
+  // or another DT_ value that the stream reported.
+  struct DirectoryEntry {
+    const char* name;
+    uint16_t nameLength;
+    uint8_t type;
+  };
+  // Answers true to go on with the next entry, false to stop.
+  using DirectoryEntryCallback = std::function<bool(const DirectoryEntry&)>;
+
+  // Hands each entry of the directory at `path` to `body`. The directory is
+  // opened with O_NOFOLLOW|O_DIRECTORY, so a link or a non-directory is
+  // refused. An entry whose type the stream leaves unknown is lstat'ed
+  // (relative to the directory) and gets the type of its mode when that is a
+  // directory, a link or a regular file. Returns 0 when the stream ended or
+  // `body` stopped, else the errno of the open, the stream or the read that
+  // failed.
+  static int _IterateDirectory(const char* path, const DirectoryEntryCallback& body);
+};

@@ -1,0 +1,5 @@
+#include "Support/Log.h"
+
+extern "C" {
+sl::InstallerLogHandle* gLogHandle = nullptr;
+}

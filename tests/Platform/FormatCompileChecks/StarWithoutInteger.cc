@@ -1,0 +1,2 @@
+#include "Platform/Format.h"
+std::string rejected() { return sl::format("%*d", 1.5, 2); }

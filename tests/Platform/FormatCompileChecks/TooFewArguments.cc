@@ -1,0 +1,2 @@
+#include "Platform/Format.h"
+std::string rejected() { return sl::format("%d %d", 1); }

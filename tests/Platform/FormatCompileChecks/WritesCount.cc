@@ -1,0 +1,2 @@
+#include "Platform/Format.h"
+std::string rejected(int* n) { return sl::format("%n", n); }
