@@ -43,9 +43,15 @@ unsigned long long asUnsigned(const FormatArg& a, const std::string& length) {
 
 template <class T>
 void appendPrintf(std::string& out, const Spec& spec, const char* length, T value) {
-  std::string f = "%" + spec.flags;
+  std::string f;
+  f.reserve(32);
+  f += '%';
+  f += spec.flags;
   if (spec.width >= 0) f += std::to_string(spec.width);
-  if (spec.precision >= 0) f += "." + std::to_string(spec.precision);
+  if (spec.precision >= 0) {
+    f += '.';
+    f += std::to_string(spec.precision);
+  }
   f += length;
   f += spec.conversion;
   int n = std::snprintf(nullptr, 0, f.c_str(), value);
