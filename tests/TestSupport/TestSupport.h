@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <sys/types.h>
 
+#include <ostream>
 #include <string>
 #include <vector>
 
@@ -59,6 +60,9 @@ class LogCapture {
     std::string function;
     std::string message;
     bool operator==(const Line&) const = default;
+    friend void PrintTo(const Line& l, std::ostream* os) {
+      *os << "{" << l.level << ", " << l.category << ", " << l.function << ", \"" << l.message << "\"}";
+    }
   };
   // Installer-log lines, then host-log lines, each in the order written.
   const std::vector<Line>& installer() const { return installer_; }
