@@ -277,6 +277,9 @@ class Walk {
   // O_PATH suffices and no read permission on it is needed. When ".." is not
   // the directory recorded on the way down, the tree was moved during the
   // walk: it stops with ESTALE, our record of where we came from being stale.
+  // A child that the caller may not search cannot give its ".." either: the
+  // walk then stops with that errno (EACCES). Only trees deeper than the
+  // budget meet this, and such a child could not be emptied anyway.
   Step reopenParent(size_t depth) {
     Level& parent = stack_[depth - 1];
     UniqueFd fd(openat(stack_[depth].fd.get(), "..", O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
@@ -318,7 +321,9 @@ int resolveTop(const char* path, std::string& topPath, UniqueFd& parentFd, std::
   size_t slash = p.rfind('/');
   std::string parent = slash == std::string::npos ? "." : slash == 0 ? "/" : p.substr(0, slash);
   name = slash == std::string::npos ? p : p.substr(slash + 1);
-  if (name == "." || name == "..") return EINVAL;  // what rmdir answers for them
+  // "." and ".." name a directory by a path that cannot be removed; emptying
+  // it first would be a surprise. Refused, as rmdir refuses ".".
+  if (name == "." || name == "..") return EINVAL;
 
   // The prefix is the caller's and may be followed; the last name is not.
   parentFd = UniqueFd(open(parent.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
