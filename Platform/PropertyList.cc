@@ -131,8 +131,10 @@ bool readFileContents(const URL& url, std::vector<uint8_t>* out, Error* error) {
   // The size is a hint only: files of /proc and the like report 0, and a
   // file may grow or shrink while it is read. Read until end of file.
   // One byte more than the size lets the read that sees end of file land in
-  // the buffer without growing it.
-  if (S_ISREG(st.st_mode) && st.st_size > 0) bytes.resize(static_cast<size_t>(st.st_size) + 1);
+  // the buffer without growing it. (The hint is capped: a sparse file may
+  // claim far more than it will ever deliver or than memory holds.)
+  constexpr off_t kLargestHint = off_t{1} << 28;
+  if (S_ISREG(st.st_mode) && st.st_size > 0) bytes.resize(static_cast<size_t>(std::min(st.st_size, kLargestHint)) + 1);
   size_t used = 0;
   for (;;) {
     if (used == bytes.size()) bytes.resize(bytes.size() + std::max<size_t>(65536, bytes.size() / 2));

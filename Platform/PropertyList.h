@@ -15,6 +15,20 @@
 // UTF-16 code unit 0xDC00 + byte, which the binary reader turns back into
 // that byte.
 //
+// Choices where the formats leave room (details at the top of
+// PropertyListXML.cc and PropertyListBinary.cc):
+//   - XML: the root element must be <plist> holding one value; documents
+//     that declare entities are refused (property lists never need them);
+//     a repeated dictionary key keeps its last value; data is written as
+//     one line of base64 and dates to the whole second.
+//   - Binary: null, fill and UID objects are refused, sets are read as
+//     arrays, 16-byte integers are read when they fit 64 bits; objects
+//     shared by several containers are parsed once, so sharing never
+//     multiplies the work of reading. (The writers do not share
+//     containers: such a value is written out unfolded, in full.)
+//   - At most kMaxPropertyListDepth arrays and dictionaries nest one inside
+//     another, in reading and in writing alike.
+//
 // Failures are POSIX records: EINVAL for malformed input, with a message
 // that says what was wrong and where, EILSEQ for text that cannot be
 // encoded, and the errno of the failing call for file access.
