@@ -5,26 +5,18 @@
 namespace {
 
 TEST(StowlineAdditions, ContainsDotDotPathComponents) {
-  const struct {
-    const char* path;
-    bool expected;
-  } kCases[] = {
-      {"a/../b", true}, {"..", true},      {"/a/b/..", true},  {"../a", true},
-      {"a/..b", false}, {"a/.../b", false}, {"a../b", false}, {"/a/./b", false}, {"", false},
+  const std::pair<const char*, bool> kCases[] = {
+      {"a/../b", true}, {"..", true}, {"/a/b/..", true}, {"a/..b", false}, {"a/.../b", false}, {"a../b", false},
   };
-  for (const auto& c : kCases) {
-    SCOPED_TRACE(c.path);
-    EXPECT_EQ(StowlineAdditions::containsDotDotPathComponents(sl::String(c.path)), c.expected);
+  for (const auto& [path, expected] : kCases) {
+    SCOPED_TRACE(path);
+    EXPECT_EQ(StowlineAdditions::containsDotDotPathComponents(sl::String(path)), expected);
   }
 }
 
 TEST(StowlineAdditions, FileSystemRepresentationKeepsBytes) {
-  // Not UTF-8: kept byte for byte, not replaced.
-  const char kName[] = "caf\xe9\xff";
-  EXPECT_EQ(StowlineAdditions::stringWithFileSystemRepresentation(kName).str(), std::string(kName));
-  // The length is what counts, not a terminator.
-  EXPECT_EQ(StowlineAdditions::stringWithFileSystemRepresentation("abcdef", 3).str(), "abc");
-  EXPECT_TRUE(StowlineAdditions::stringWithFileSystemRepresentation(nullptr).isNull());
+  EXPECT_EQ(StowlineAdditions::stringWithFileSystemRepresentation("caf\xe9\xff").str(), "caf\xe9\xff");
+  EXPECT_EQ(StowlineAdditions::stringWithFileSystemRepresentation("abcdef", 3).str(), "abc");  // length, not NUL
 }
 
 }  // namespace
