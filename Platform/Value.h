@@ -99,8 +99,8 @@ class Value {
   // 1.0); no value of one kind equals a value of another.
   friend bool operator==(const Value& a, const Value& b);
 
-  // The platform's name of the value's type, as error messages print it
-  // ("NSString"-like names are not used: "String", "Dictionary", ...).
+  // The name of the value's kind as messages print it: "String",
+  // "Dictionary", ... ("Null" for a null handle).
   std::string_view typeName() const;
 
  protected:
