@@ -32,6 +32,9 @@
 // any thread may call any of them at any time.
 #pragma once
 
+#include <fts.h>
+#include <sys/types.h>
+
 #include <cstdint>
 #include <functional>
 #include <optional>
@@ -39,6 +42,7 @@
 
 #include "Platform/Error.h"
 #include "Platform/URL.h"
+#include "Platform/Value.h"
 
 class SLFileManager {
  public:
@@ -72,6 +76,73 @@ class SLFileManager {
   bool itemExistsAtURL(const sl::URL& url);
   bool itemDoesNotExistAtURL(const sl::URL& url);
 
+  // ---- Directory creation, copy, move and temporary directories ----
+
+  // Creates the directory (with missing parents when asked) with `mode`; an
+  // item that already stands at the path is no failure. With a
+  // protectionClass other than -1 the class is then set on the directory,
+  // whether it was made now or stood there already.
+  bool createDirectoryAtURL(const sl::URL& url, bool withIntermediateDirectories, mode_t mode,
+                            int32_t protectionClass, sl::Error* error = nullptr);
+  bool createDirectoryAtURL(const sl::URL& url, bool withIntermediateDirectories, mode_t mode,
+                            sl::Error* error = nullptr);
+
+  // Copy and move of whole items, links as links. The IfExists forms treat
+  // a missing source as nothing to do; the plain forms fail with ENOENT. A
+  // move is one rename on one volume; across volumes (EXDEV, and only then)
+  // it copies and removes the source.
+  bool copyItemIfExistsAtURL(const sl::URL& source, const sl::URL& destination, sl::Error* error = nullptr);
+  bool moveItemIfExistsAtURL(const sl::URL& source, const sl::URL& destination, sl::Error* error = nullptr);
+  bool copyItemAtURL(const sl::URL& source, const sl::URL& destination, sl::Error* error = nullptr);
+  bool moveItemAtURL(const sl::URL& source, const sl::URL& destination, sl::Error* error = nullptr);
+
+  // A new directory "temp.XXXXXX" (mode 0700) in `parent`; null on failure.
+  // Unlike every other operation, this one clears the error slot on entry.
+  sl::URL createTemporaryDirectoryInDirectoryURL(const sl::URL& parent, sl::Error* error = nullptr);
+
+  // ---- Symbolic links, real paths and the containment check ----
+
+  bool createSymbolicLinkAtURL(const sl::URL& url, const sl::URL& withDestinationURL, sl::Error* error = nullptr);
+  // The link's content as a file URL, unresolved; null on failure.
+  sl::URL destinationOfSymbolicLinkAtURL(const sl::URL& url, sl::Error* error = nullptr);
+
+  // The real path of `url` when it lies inside `ifChildOfURL`, else null
+  // (each refusal is one error line in the installer log).
+  sl::URL realPathForURL(const sl::URL& url, const sl::URL& ifChildOfURL);
+
+  // ---- Bundle markers in extended attributes ----
+
+  bool markBundleAsPlaceholder(const sl::URL& url, sl::Error* withError = nullptr);
+  bool bundleAtURLIsPlaceholder(const sl::URL& url);
+  bool setInstallType(const sl::Number& installType, const sl::URL& onBundle, sl::Error* error = nullptr);
+  // The install type (0 when the attribute is absent); null on failure.
+  sl::Number installTypeForBundle(const sl::URL& url, sl::Error* error = nullptr);
+
+  // ---- Store data capture ----
+
+  // Carries the store metadata items (the configuration's bundle metadata
+  // item names) from one directory into another, each by itself.
+  bool captureStoreDataFromDirectory(const sl::URL& source, const sl::URL& toDirectory, bool doCopy,
+                                     bool failureIsFatal, sl::Error* withError = nullptr);
+
+  // ---- Data protection classes ----
+
+  bool dataProtectionClassOfItemAtURL(const sl::URL& url, int32_t* protectionClass, sl::Error* error = nullptr);
+  // Answers whether to change an item whose class is currently `current`.
+  using ProtectionClassPredicate = std::function<bool(int32_t current)>;
+  // An empty predicate changes the class unconditionally; a predicate that
+  // declines leaves it and still succeeds.
+  bool setDataProtectionClassOfItemAtURL(const sl::URL& url, int32_t toClass, const ProtectionClassPredicate& ifPredicate,
+                                         sl::Error* error = nullptr);
+
+  // ---- Traversal and ownership standardisation ----
+
+  // Brings a tree to one owner and to modes 0755 (directories) and 0644
+  // (everything else); with validateSymlinks, a link whose real location is
+  // not inside the root stops the walk.
+  bool standardizeOwnershipAtURL(const sl::URL& url, uid_t toUID, gid_t GID, bool validateSymlinks,
+                                 sl::Error* error = nullptr);
+
  private:
   SLFileManager() = default;
 
@@ -94,4 +165,24 @@ class SLFileManager {
   // `body` stopped, else the errno of the open, the stream or the read that
   // failed.
   static int _IterateDirectory(const char* path, const DirectoryEntryCallback& body);
+
+  bool _copyItemAtURL(const sl::URL& source, const sl::URL& destination, bool failIfSrcMissing, sl::Error* error);
+  bool _moveItemAtURL(const sl::URL& source, const sl::URL& destination, bool failIfSrcMissing, sl::Error* error);
+
+  // The lexical depth walk: ".." lowers the depth, "", "." and "/" leave it,
+  // anything else raises it. Answers false as soon as it falls below the
+  // starting depth; otherwise stores the final depth (when asked) and
+  // answers true.
+  bool _validateSymlink(const sl::String& path, int32_t withStartingDepth, int32_t* andEndingDepth);
+  sl::URL _realPathForURL(const sl::URL& url, bool allowNonExistentPathComponents);
+  sl::URL _realPathWhatExistsInPath(const sl::String& path);
+
+  // Hands every entry of a physical walk (links reported, never followed;
+  // the walk stays on the root's volume) to `withBlock`, directories before
+  // and after their contents. The callback answers false to stop, and may
+  // leave a record in the slot it is given.
+  using TraversalCallback = std::function<bool(FTSENT* entry, sl::Error* error)>;
+  bool _traverseDirectory(const sl::URL& url, sl::Error* error, const TraversalCallback& withBlock);
+
+  friend class SLFileManagerTestAccess;
 };
