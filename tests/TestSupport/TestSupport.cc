@@ -10,6 +10,7 @@
 #include <cstring>
 #include <fstream>
 #include <sstream>
+#include <stdexcept>
 
 #include <gtest/gtest.h>
 
@@ -22,8 +23,8 @@ TempDir::TempDir(const char* parent) {
   std::string base = parent ? parent : (getenv("TMPDIR") ? getenv("TMPDIR") : "/tmp");
   std::string templ = base + "/sltest.XXXXXX";
   if (mkdtemp(templ.data()) == nullptr) {
-    ADD_FAILURE() << "mkdtemp under " << base << ": " << strerror(errno);
-    return;
+    // A test must never fall back to paths below "/": stop it here.
+    throw std::runtime_error("TempDir: mkdtemp under " + base + " failed: " + strerror(errno));
   }
   // Searchable by everyone, so that tests running as nobody reach their tree.
   chmod(templ.c_str(), 0755);

@@ -14,7 +14,8 @@
 namespace sl::test {
 
 // A fresh directory under `parent` (default: $TMPDIR or /tmp), removed with
-// everything in it when the scope ends. Trees that are large or short-lived
+// everything in it when the scope ends. When it cannot be made the
+// constructor throws, which fails the test before it can touch any path. Trees that are large or short-lived
 // belong under /dev/shm: pass kShm.
 class TempDir {
  public:

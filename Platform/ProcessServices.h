@@ -1,0 +1,83 @@
+// Process-wide services: the CPU-usage monitor, process transactions,
+// serial task queues, the crash reporter's record and the report of an
+// uncaught exception.
+#pragma once
+
+#include <sys/types.h>
+
+#include <cstdint>
+#include <exception>
+#include <functional>
+#include <memory>
+#include <string>
+#include <vector>
+
+namespace sl {
+
+// ---- CPU-usage monitor ----
+// Linux enforces no CPU-usage limit on a process; the monitor is process-wide
+// state that can be switched off and back to its defaults, and queried.
+int proc_disable_cpumon(pid_t pid);
+int proc_set_cpumon_defaults(pid_t pid);
+// Whether the monitor of the own process is on (its default).
+bool cpuMonitorIsEnabled();
+
+// ---- Process transactions ----
+// While at least one transaction is open, the process is not ended for being
+// idle. Begin and end nest; the count can be queried.
+void processTransactionBegin();
+void processTransactionEnd();
+int64_t openProcessTransactions();
+
+// ---- Task queues ----
+// A serial queue backed by one worker thread: tasks run one at a time, in
+// the order they were submitted. The destructor runs the tasks already
+// submitted, then joins the worker.
+class TaskQueue {
+ public:
+  explicit TaskQueue(std::string label);
+  ~TaskQueue();
+  TaskQueue(const TaskQueue&) = delete;
+  TaskQueue& operator=(const TaskQueue&) = delete;
+
+  void async(std::function<void()> task);
+  const std::string& label() const;
+
+ private:
+  struct State;
+  std::unique_ptr<State> state_;
+};
+
+// ---- Crash reporter record ----
+// A 64-byte, 8-aligned record in the library's data that a crash reporter
+// reads from a crashed process: version 5 at offset 0, the address of a
+// NUL-terminated message at offset 8, six further 8-byte fields that stay 0.
+struct CrashReporterInfo {
+  uint64_t version;
+  const char* message;
+  uint64_t reserved[6];
+};
+static_assert(sizeof(CrashReporterInfo) == 64 && alignof(CrashReporterInfo) == 8);
+extern "C" CrashReporterInfo gCRAnnotations;
+
+// The calling thread's name; false when it has none that can be read.
+bool currentThreadName(std::string* name);
+
+// ---- Uncaught exceptions ----
+// The report of a C++ exception: name = the demangled type of the exception
+// object, reason = what() for a std::exception (none otherwise), stack = the
+// frames of the handler's own stack as backtrace_symbols gives them.
+struct ExceptionReport {
+  std::string name;
+  bool hasReason = false;
+  std::string reason;
+  std::vector<std::string> callStackSymbols;
+};
+ExceptionReport reportForException(std::exception_ptr exception);
+
+// Installs, with std::set_terminate, a handler that hands the current
+// exception's report to `handler` (which does not return). For programs that
+// want it.
+void installUncaughtExceptionHandler(void (*handler)(const ExceptionReport&));
+
+}  // namespace sl
