@@ -25,8 +25,11 @@ inline constexpr copyfile_flags_t COPYFILE_NOFOLLOW_SRC = 1u << 18;
 inline constexpr copyfile_flags_t COPYFILE_NOFOLLOW_DST = 1u << 19;
 inline constexpr copyfile_flags_t COPYFILE_NOFOLLOW = COPYFILE_NOFOLLOW_SRC | COPYFILE_NOFOLLOW_DST;
 
-// Copies the item at `from` to `to`. Returns 0, or -1 with errno. `state`
-// must be null (no copy state is kept here).
+// Copies the item at `from` to `to`. Returns 0, or -1 with errno of the
+// first failure; a partial copy is left in place. `state` must be null (no
+// copy state is kept here): a state, a null path or a flag not declared
+// above fails with EINVAL. The behaviour in full (kinds, links, metadata,
+// what happens to what stands at `to`) is described in Copyfile.cc.
 int copyfile(const char* from, const char* to, copyfile_state_t state, copyfile_flags_t flags);
 
 }  // namespace sl
