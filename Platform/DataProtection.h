@@ -4,6 +4,11 @@
 // attribute kProtectionClassAttribute of the item itself and read and set
 // through an open descriptor of it. An item without the attribute has class
 // 0. These stand in for the fcntl commands of the same names.
+//
+// The attribute holds the class as a 32-bit little-endian integer, exactly
+// 4 bytes. A stored value of another length or outside 1..7 was not written
+// here and reads as EINVAL. A volume that cannot hold user attributes
+// (ENOTSUP) reports class 0 for every item, and refuses to set one.
 #pragma once
 
 namespace sl {

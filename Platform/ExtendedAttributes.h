@@ -27,12 +27,16 @@ inline constexpr int ENOATTR = ENODATA;
 std::string linuxAttributeName(std::string_view name);
 
 // As the system calls of the same names, with a `position` that must be 0
-// (other values fail with EINVAL) and `options` from the flags above.
+// and `options` made of the flags above (another position or any other bit
+// fails with EINVAL; XATTR_CREATE and XATTR_REPLACE matter to the setters
+// only). Each answers what the Linux call answers, -1 with errno on failure.
 ssize_t getxattr(const char* path, const char* name, void* value, size_t size, uint32_t position, int options);
 int setxattr(const char* path, const char* name, const void* value, size_t size, uint32_t position, int options);
 int removexattr(const char* path, const char* name, int options);
 
-// On an open descriptor.
+// On an open descriptor; XATTR_NOFOLLOW changes nothing there, the
+// descriptor already names the item. An O_PATH descriptor cannot carry
+// these calls (EBADF).
 ssize_t fgetxattr(int fd, const char* name, void* value, size_t size, uint32_t position, int options);
 int fsetxattr(int fd, const char* name, const void* value, size_t size, uint32_t position, int options);
 
