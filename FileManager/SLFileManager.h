@@ -38,6 +38,7 @@
 #include <cstdint>
 #include <functional>
 #include <optional>
+#include <string>
 #include <vector>
 
 #include "Platform/Error.h"
@@ -112,7 +113,15 @@ class SLFileManager {
 
   // ---- Bundle markers in extended attributes ----
 
+  // Two attributes of the bundle directory itself, never of a link's target
+  // (Linux refuses user attributes on a link: EPERM to a write, absent to a
+  // read): "com.vantor.stowd.placeholder", 4 bytes holding 1, and
+  // "com.vantor.stowd.installType", 8 bytes; both little-endian. A failure is
+  // a logged record in SLInstallerErrorDomain, code 4, with the bare POSIX
+  // record of errno as its underlying error when a call failed.
   bool markBundleAsPlaceholder(const sl::URL& url, sl::Error* withError = nullptr);
+  // True exactly when a 4-byte placeholder value is there (its bytes are not
+  // looked at); every failure answers false, unlogged.
   bool bundleAtURLIsPlaceholder(const sl::URL& url);
   bool setInstallType(const sl::Number& installType, const sl::URL& onBundle, sl::Error* error = nullptr);
   // The install type (0 when the attribute is absent); null on failure.
@@ -120,18 +129,32 @@ class SLFileManager {
 
   // ---- Store data capture ----
 
-  // Carries the store metadata items (the configuration's bundle metadata
-  // item names) from one directory into another, each by itself.
+  // The store metadata items, in the order they are captured: "Manifest.plist",
+  // "JukoraArtwork", "JukoraMetadata.plist", "GeoJSON". This is the one list
+  // of those names: the configuration answers this same list as its bundle
+  // metadata item names.
+  static const std::vector<std::string>& storeDataItemNames();
+
+  // Carries the store metadata items (storeDataItemNames()) from one
+  // directory into another, each by itself, by copy or by move. A missing
+  // item is not carried and is no failure. A failing item leaves one logged
+  // record (SLInstallerErrorDomain, code 24, "LegacyErrorString" naming the
+  // item); with failureIsFatal it ends the capture and is returned, items
+  // carried before it staying where they went; without, the capture goes on
+  // and succeeds.
   bool captureStoreDataFromDirectory(const sl::URL& source, const sl::URL& toDirectory, bool doCopy,
                                      bool failureIsFatal, sl::Error* withError = nullptr);
 
   // ---- Data protection classes ----
 
+  // Both open the item itself (a link fails at the open with ELOOP) and
+  // report failures as POSIX records, unlogged.
   bool dataProtectionClassOfItemAtURL(const sl::URL& url, int32_t* protectionClass, sl::Error* error = nullptr);
   // Answers whether to change an item whose class is currently `current`.
   using ProtectionClassPredicate = std::function<bool(int32_t current)>;
-  // An empty predicate changes the class unconditionally; a predicate that
-  // declines leaves it and still succeeds.
+  // An empty predicate changes the class unconditionally. A predicate is
+  // called once, with the class read just before; when it declines, the
+  // class stays and the operation succeeds.
   bool setDataProtectionClassOfItemAtURL(const sl::URL& url, int32_t toClass, const ProtectionClassPredicate& ifPredicate,
                                          sl::Error* error = nullptr);
 
