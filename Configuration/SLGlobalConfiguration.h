@@ -44,17 +44,30 @@ class SLGlobalConfiguration {
   SLGlobalConfiguration& operator=(const SLGlobalConfiguration&) = delete;
 
   // ---- Settings ----
+  // Read once, by the constructor, from the domain "com.vantor.stowline";
+  // each setting that a stored value changes writes one notice line under
+  // "-[SLGlobalConfiguration init]". Only the boolean false turns
+  // "LowerInstallPriority" off (default on), only the boolean true turns
+  // "SkipDeviceFamilyCheck" or "SkipThinningCheck" on, and any number is
+  // taken for "SimultaneousInstallsNumber" (default 4, no range check);
+  // values of other kinds are ignored without a word.
   bool lowerInstallPriority() const { return _lowerInstallPriority; }
   bool skipDeviceFamilyCheck() const { return _skipDeviceFamilyCheck; }
   bool skipThinningCheck() const { return _skipThinningCheck; }
   int32_t nSimultaneousInstallations() const { return _nSimultaneousInstallations; }
   uint32_t uid() const { return _uid; }
   uint32_t gid() const { return _gid; }
-  // Computed once per process and cached.
+  // Asked on the first call, once (thread-safely), and cached; with one
+  // instance per process that is once per process. Linux enforces no code
+  // signing: always true.
   bool codeSigningEnforcementIsDisabled();
 
-  // The persisted flag, read and written through the preferences store on
-  // every call.
+  // The persisted flag "UpdatedPluginContainersWithParentIDWithSafeHarborFix"
+  // of "com.vantor.stowline", read and written through the preferences store
+  // on every call: absent reads false, any value but the boolean false reads
+  // true. The setter stores a boolean and synchronises the domain at once; a
+  // failed synchronise is not reported (the value stays pending in this
+  // process).
   bool haveUpdatedPluginContainersWithParentID();
   void setHaveUpdatedPluginContainersWithParentID(bool value);
   // "ThinnedAppVariantID" of the suite "com.vantor.jukorastored", read on
@@ -72,6 +85,10 @@ class SLGlobalConfiguration {
   sl::URL roleUserMigrationMarkerFilePath();
 
   // ---- Paths: cached, and created on every call ----
+  // Each holds the lock for the whole call, creation included, and asks for
+  // the directory (with its parents, mode 0755) on every call. A failure is
+  // logged at level error under the accessor's name, with the path and the
+  // record, and the path is returned all the same.
   sl::URL carrierBundlesDirectory();
   sl::URL stagingRoot();  // class 4; computed from cachesDirectory under the same lock
   sl::URL dataDirectory();  // class 4; the same path as dataDirectoryPath
@@ -104,6 +121,16 @@ class SLGlobalConfiguration {
   // A catalogue maps a bundle identifier to a dictionary holding
   // "PBBundleIdentifier", "PBBundleVersion" (when the bundle has them) and
   // "com.vantor.Stowline.bundleURL".
+  //
+  // The basalt, system and internal catalogues and the framework set are
+  // scanned on first use and cached under the lock; an application catalogue
+  // is null (and scanned again on the next call) while its directory cannot
+  // be listed, whereas the framework set is cached even when every scan
+  // failed. The rescans empty the cached fields: reScanSystemApps and
+  // reScanInternalApps their catalogue and the framework set,
+  // reScanBasaltApps its catalogue. The disk-image catalogue is built on
+  // every call, never null; builtInApplicationBundleIDs is the union of the
+  // system, internal and disk-image catalogues' identifiers (not basalt).
   sl::Dictionary basaltAppBundleIDToInfoMap();
   sl::Dictionary systemAppBundleIDToInfoMap();
   sl::Dictionary internalAppBundleIDToInfoMap();
@@ -115,12 +142,24 @@ class SLGlobalConfiguration {
   void reScanInternalApps();
 
   // ---- Disk images ----
-  // The mount point of the first medium below the entry that is mounted.
+  // Neither cached nor locked: each call walks the device registry and reads
+  // the mount table afresh. Failures are logged, never returned.
+  //
+  // The mount point of the first medium below the entry that is mounted;
+  // null when none is (or the registry or mount table fails).
   sl::String mountPointForDevice(sl::dv_object_t device);
+  // The mount points of the attached image drives, in registry order; empty
+  // without a disk-image controller.
   std::vector<sl::String> diskImageMountPoints();
+  // MOUNTPOINT/Applications for each mount point that does not begin with
+  // "/private/var/debug_mount", then developerAppsDirectory() unless it is
+  // already there: never empty.
   std::vector<sl::URL> diskImageApplicationsDirectories();
 
  private:
+  // The catalogue of the entries of `directory` whose extension is exactly
+  // `withExtension` (symbolic links left out); null when the directory
+  // cannot be listed. Takes no lock of its own.
   sl::Dictionary _bundleIDMapForBundlesInDirectory(const sl::URL& directory, const std::string& withExtension);
   sl::Dictionary _bundleIDMapForAppsInDirectory(const sl::URL& directory);
 

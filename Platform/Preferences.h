@@ -22,7 +22,8 @@
 
 namespace sl {
 
-// The file that holds a domain.
+// The file that holds a domain (a plain name, no separators), below the
+// system root as it is when this is called.
 URL preferencesFileURL(std::string_view domain);
 
 // The value stored under key, or null when absent (or the domain's file is
@@ -33,13 +34,17 @@ Value preferencesCopyValue(std::string_view key, std::string_view domain);
 // the next preferencesSynchronize of the domain.
 void preferencesSetValue(std::string_view key, const Value& value, std::string_view domain);
 
-// Writes the domain's pending changes atomically, merged over what the file
-// holds now. Returns false with a record when the write fails (the changes
-// then stay pending).
+// Writes the domain's pending changes atomically (XML), merged over what the
+// file holds now; a file that is missing or not a readable dictionary is
+// replaced. The Preferences directory is made (mode 0755, with its parents)
+// when missing. With nothing pending it writes nothing and succeeds. Returns
+// false with a POSIX record when the directory cannot be made
+// ("mkpath_np of <dir> failed: <strerror>") or the write fails (the record
+// of writePropertyListToURL); the changes then stay pending.
 bool preferencesSynchronize(std::string_view domain, Error* error = nullptr);
 
-// Forgets every pending change and cached value, for tests that change the
-// system root.
+// Forgets every pending change (the store caches nothing else), for tests
+// that must not see another test's unsynchronised writes.
 void preferencesResetForTesting();
 
 }  // namespace sl
