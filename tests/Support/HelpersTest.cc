@@ -1,0 +1,135 @@
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <pthread.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <future>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "Platform/UniqueFd.h"
+#include "Support/Helpers.h"
+
+namespace {
+
+using sl::Array;
+using sl::Boolean;
+using sl::Number;
+using sl::String;
+using sl::ValueKind;
+
+TEST(HelpersTest, ValueCoercions) {
+  String name("Documents");
+  EXPECT_EQ(SLStringifyObject(Number(42)), "42");
+  EXPECT_EQ(SLStringifyObject(name).c_str(), name.c_str());  // the same node, not a copy
+  EXPECT_TRUE(SLStringifyObject(nullptr).isNull());
+
+  EXPECT_FALSE(SLBooleanValue(String("YES"), false));
+  EXPECT_TRUE(SLBooleanValue(Number(2), false));
+  EXPECT_FALSE(SLBooleanValue(Boolean(false), true));
+  EXPECT_TRUE(SLBooleanValue(nullptr, true));
+
+  // Booleans are numbers; nothing else derives.
+  EXPECT_TRUE(SLArrayContainsOnlyClass(Array{Number(1), Boolean(true)}, ValueKind::Number));
+  EXPECT_FALSE(SLArrayContainsOnlyClass(Array{Number(1)}, ValueKind::Boolean));
+
+  EXPECT_EQ(SLArrayifyThing(name, ValueKind::String), (Array{name}));
+  EXPECT_TRUE(SLArrayifyThing(Array{name, Number(1)}, ValueKind::String).isNull());
+  Array empty = SLArrayifyThing(Array::create(), ValueKind::String);
+  EXPECT_TRUE(!empty.isNull() && empty.isEmpty());
+  // Asked for arrays, an array is a list of arrays, not one item.
+  EXPECT_EQ(SLArrayifyThing(Array{Array{name}}, ValueKind::Array), (Array{Array{name}}));
+}
+
+TEST(HelpersTest, ResourceAssertionsNest) {
+  ASSERT_TRUE(sl::cpuMonitorIsEnabled());
+  SLAssertHighResourceUsage();
+  SLAssertHighResourceUsage();
+  SLClearResourceAssertion();
+  EXPECT_FALSE(sl::cpuMonitorIsEnabled());
+  SLClearResourceAssertion();
+  EXPECT_TRUE(sl::cpuMonitorIsEnabled());
+}
+
+TEST(HelpersTest, TransactionalTasksRunInOrderInsideTheirTransactions) {
+  std::vector<int64_t> openDuring;
+  std::promise<void> gate;
+  auto token = std::make_shared<int>(0);
+  std::weak_ptr<int> watch = token;
+  {
+    sl::TaskQueue queue("transactions");
+    queue.async([ready = gate.get_future().share()] { ready.wait(); });
+    for (int i = 1; i <= 3; ++i) {
+      SLRunTransactionalTask(queue, [&, token] { openDuring.push_back(sl::openProcessTransactions()); });
+    }
+    token.reset();
+    // Opened by the calls themselves while the tasks wait; the queued tasks
+    // keep what they captured alive.
+    EXPECT_EQ(sl::openProcessTransactions(), 3);
+    EXPECT_FALSE(watch.expired());
+    gate.set_value();
+  }
+  // In order, each inside its own transaction and those queued after it.
+  EXPECT_EQ(openDuring, (std::vector<int64_t>{3, 2, 1}));
+  EXPECT_EQ(sl::openProcessTransactions(), 0);
+  EXPECT_TRUE(watch.expired());
+}
+
+// The child's SIGABRT handler sends the crash record's message to the parent
+// through this descriptor; the abort then goes on.
+int gRecordFd = -1;
+void sendCrashRecord(int) {
+  if (const char* message = sl::gCRAnnotations.message) (void)!write(gRecordFd, message, strlen(message));
+}
+
+std::string readAll(const sl::UniqueFd& fd) {
+  std::string out;
+  char buffer[512];
+  for (ssize_t n; (n = read(fd.get(), buffer, sizeof buffer)) > 0;) out.append(buffer, n);
+  return out;
+}
+
+TEST(HelpersTest, CrashOnExceptionWritesTheReportAndAborts) {
+  struct Case {
+    const char* threadName;
+    sl::ExceptionReport report;
+    std::string expected;
+  };
+  const Case cases[] = {
+      {"T",
+       {"X", true, "Y", {"f1", "f2"}},
+       "** INTERNAL ERROR: Uncaught Exception **\nException: <T> X: Y\nStack:\nf1\nf2"},
+      // An empty thread name is still a name; no exception name, no reason.
+      {"", {"", false, "", {}}, "** INTERNAL ERROR: Uncaught Exception **\nException: <> \nStack:\n"},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.expected);
+    int errPipe[2], recordPipe[2];
+    ASSERT_EQ(pipe2(errPipe, O_CLOEXEC), 0);
+    sl::UniqueFd errRead(errPipe[0]), errWrite(errPipe[1]);
+    ASSERT_EQ(pipe2(recordPipe, O_CLOEXEC), 0);
+    sl::UniqueFd recordRead(recordPipe[0]), recordWrite(recordPipe[1]);
+    pid_t child = fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+      dup2(errWrite.get(), STDERR_FILENO);
+      gRecordFd = recordWrite.get();
+      signal(SIGABRT, sendCrashRecord);
+      pthread_setname_np(pthread_self(), c.threadName);
+      SLCrashOnException(c.report);
+    }
+    errWrite.reset();
+    recordWrite.reset();
+    EXPECT_EQ(readAll(recordRead), c.expected);
+    EXPECT_EQ(readAll(errRead), c.expected + "\n");
+    int status = 0;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGABRT) << status;
+  }
+}
+
+}  // namespace
