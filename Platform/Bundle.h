@@ -4,6 +4,10 @@
 // A bundle's info dictionary is that file's dictionary plus
 // kBundleInfoPlistURLKey, the file's URL, as the facility adds it. Its
 // identifier is the string under kBundleIdentifierKey.
+//
+// A bundle object caches its info dictionary without a lock: it belongs to
+// the caller that made it and is not used from two threads at once. In
+// messages a bundle is written as its URL (url()).
 #pragma once
 
 #include <memory>
@@ -36,10 +40,12 @@ class Bundle {
   String identifier() const;
 
   // A new object read from "Info.plist" now: its dictionary with only the
-  // top-level keys named in `keys` (an array of strings; others are
-  // ignored), or, when the file's top level is not a dictionary, that value
-  // as it is. Null when the file cannot be read or parsed. `options` is the
-  // caller's selector of the read and does not change the result.
+  // top-level keys named in `keys` (an array of strings; other values are
+  // ignored, and a null or empty array keeps no key), or, when the file's
+  // top level is not a dictionary, that value as it is. Null when the file
+  // cannot be read or parsed. kBundleInfoPlistURLKey is not added: the
+  // result holds only what the file has. `options` is the caller's selector
+  // of the read and does not change the result.
   Value createFilteredInfoPlist(const Array& keys, int options) const;
 
  private:
