@@ -6,11 +6,19 @@
 // backing file (block/loopN/loop/backing_file) is one attached image drive
 // ("DVQVAMHDDrive"); the device itself and its partitions (loopNpM) are its
 // media ("DVMedia"), each with the property "BSD Name" = "loopN" or
-// "loopNpM". All of them hang in the service plane ("DVService").
+// "loopNpM". All of them hang in the service plane ("DVService"):
+//
+//   controller > drive loopN > medium loopN > media loopNp1, loopNp2, ...
+//
+// Drives come in numeric order of N, partitions in numeric order of M. Each
+// entry conforms to its own class only.
 //
 // Handles are small non-zero integers into a table the layer owns; 0 is no
 // handle. Every handle obtained (entries and iterators) must be released
 // with dvObjectRelease. A machine without loop devices has no controller.
+// The tree is read from sysfs when a service is looked up and when an
+// iterator is made; an iterator hands out what it saw then. All functions
+// may be called from any thread.
 //
 // The sysfs tree and the mount table are read from locations that tests can
 // replace with a made-up tree (setDeviceRegistryLocations).
@@ -45,7 +53,10 @@ void setDeviceRegistryLocations(std::string_view sysfsRoot, std::string_view mou
 dv_object_t dvServiceGetMatchingService(const char* className);
 
 // An iterator over the entry's children in the plane, or with
-// kDVRegistryIterateRecursively over all its descendants (depth first).
+// kDVRegistryIterateRecursively over all its descendants (depth first, each
+// before its own descendants). kDVReturnBadArgument for a plane other than
+// kDVServicePlane, for 0 or any handle that is not a live entry, and for a
+// null `iterator`; `*iterator` is written only on success.
 dv_return_t dvRegistryEntryCreateIterator(dv_object_t entry, const char* plane, uint32_t options,
                                           dv_iterator_t* iterator);
 
@@ -72,8 +83,10 @@ struct MountEntry {
   std::string mntOnName;
 };
 
-// The current mount table (what getmntinfo(MNT_NOWAIT) answers); an empty
-// table with errno set when it cannot be read.
+// The current mount table (what getmntinfo(MNT_NOWAIT) answers), in the
+// order of the file; lines of another shape are passed over. An empty table
+// with errno set when it cannot be read (EINVAL when it holds no mount at
+// all).
 std::vector<MountEntry> getmntinfo();
 
 }  // namespace sl
