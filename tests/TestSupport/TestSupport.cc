@@ -119,6 +119,18 @@ void LogCapture::clear() {
   host_.clear();
 }
 
+void expectRecord(const Error& record, std::string_view domain, int64_t code, const std::string& message,
+                  const char* function) {
+  ASSERT_FALSE(record.isNull()) << "expected a record: " << message;
+  EXPECT_EQ(record.domain(), domain);
+  EXPECT_EQ(record.code(), code) << record.description();
+  EXPECT_EQ(record.localizedDescription().str(), message);
+  if (function != nullptr) {
+    EXPECT_EQ(record.userInfo().get("FunctionName").asString().str(), function);
+    EXPECT_FALSE(record.userInfo().get("SourceFileLine").asNumber().isNull());
+  }
+}
+
 ScopedUnprivileged::ScopedUnprivileged() {
   // setfsgid/setfsuid act on the calling thread only; leaving fsuid 0 drops
   // the file capabilities (CAP_DAC_OVERRIDE and the like) from the effective

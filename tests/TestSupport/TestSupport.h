@@ -9,7 +9,9 @@
 #include <string>
 #include <vector>
 
+#include "Platform/Error.h"
 #include "Platform/Log.h"
+#include "Platform/URL.h"
 
 namespace sl::test {
 
@@ -76,6 +78,26 @@ class LogCapture {
   std::vector<Line> installer_;
   std::vector<Line> host_;
 };
+
+// A file URL of a path.
+inline URL fileURL(const std::string& path, bool isDirectory = false) {
+  return URL::fileURLWithPath(path, isDirectory);
+}
+
+// One installer-log line as LogCapture records it.
+inline LogCapture::Line installerLine(int level, const char* function, const std::string& message) {
+  return {level, "installer", function, message};
+}
+
+// Checks a record made by the error constructors: domain, code, message,
+// "FunctionName" and that "SourceFileLine" is present. `function` may be
+// null to skip the function check (records made by platform code carry
+// none).
+void expectRecord(const Error& record, std::string_view domain, int64_t code, const std::string& message,
+                  const char* function);
+inline void expectPOSIXRecord(const Error& record, int code, const std::string& message, const char* function) {
+  expectRecord(record, kPOSIXErrorDomain, code, message, function);
+}
 
 // While it lives, the calling thread's file-system identity is the
 // unprivileged user nobody (65534), so permission checks apply to it even
