@@ -146,6 +146,7 @@
 #include <utility>
 #include <vector>
 
+#include "Platform/DirectoryEntries.h"
 #include "Platform/UniqueFd.h"
 
 struct sl::copyfile_state {};
@@ -177,10 +178,7 @@ struct Attribute {
 };
 using Attributes = std::vector<Attribute>;
 
-struct Entry {
-  std::string name;
-  unsigned char type;  // d_type of the listing: a hint only
-};
+using Entry = DirectoryEntry;
 
 struct Identity {
   dev_t dev;
@@ -315,24 +313,6 @@ int readLink(int dirFd, const std::string& name, off_t sizeHint, std::string& ta
     size *= 2;  // the link grew since lstat
   }
   return ENAMETOOLONG;
-}
-
-// Reads the entries of the directory open at fd, "." and ".." left out.
-// Returns 0 or the errno. fd itself stays open: the stream works on a
-// duplicate.
-int listDirectory(int fd, std::vector<Entry>& entries) {
-  UniqueFd dup(fcntl(fd, F_DUPFD_CLOEXEC, 0));
-  if (!dup) return errno;
-  UniqueDir dir = sl::fdopendir(dup);
-  if (!dir) return errno;
-  for (;;) {
-    errno = 0;
-    const dirent* entry = readdir(dir.get());
-    if (entry == nullptr) return errno;  // 0 at the end of the stream
-    const char* name = entry->d_name;
-    if (name[0] == '.' && (name[1] == '\0' || (name[1] == '.' && name[2] == '\0'))) continue;
-    entries.push_back(Entry{name, entry->d_type});
-  }
 }
 
 // The destination item whose metadata is set: an open descriptor, or a name
@@ -651,7 +631,7 @@ class Copier {
     }
     if (int err = readAttributes(AttributePlace::of(src.get()), level.attributes); err != 0) return err;
     if ((flags_ & COPYFILE_RECURSIVE) != 0) {
-      if (int err = listDirectory(src.get(), level.entries); err != 0) return err;
+      if (int err = readDirectoryEntries(src.get(), level.entries); err != 0) return err;
     }
     level.src = std::move(src);
     level.srcId = identityOf(st);

@@ -1,29 +1,21 @@
 #include "Platform/HostLog.h"
 
-#include <mutex>
-
-#include "Platform/LogSinkDefault.h"
+#include "Platform/LogSinkSlot.h"
 
 namespace sl {
 
 namespace {
-std::mutex gSinkMutex;
-LogSink gSink;  // guarded by gSinkMutex; empty means standard error
+detail::LogSinkSlot& slot() {
+  static detail::LogSinkSlot* const instance = new detail::LogSinkSlot();  // outlives every logger
+  return *instance;
+}
 }  // namespace
 
-LogSink setHostLogSink(LogSink sink) {
-  std::lock_guard lock(gSinkMutex);
-  return std::exchange(gSink, std::move(sink));
-}
+LogSink setHostLogSink(LogSink sink) { return slot().exchange(std::move(sink)); }
 
 void hostLogWrite(const char* file, const char* function, int line, const char* category, int level,
                   std::string_view message) {
-  LogRecord record{level, category ? category : "", function ? function : "", file ? file : "", line, message};
-  std::lock_guard lock(gSinkMutex);
-  if (gSink)
-    gSink(record);
-  else
-    detail::writeRecordToStandardError(record);
+  slot().write(LogRecord{level, category ? category : "", function ? function : "", file ? file : "", line, message});
 }
 
 }  // namespace sl

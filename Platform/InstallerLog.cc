@@ -1,9 +1,8 @@
 #include "Platform/InstallerLog.h"
 
-#include <mutex>
 #include <string>
 
-#include "Platform/LogSinkDefault.h"
+#include "Platform/LogSinkSlot.h"
 
 namespace sl {
 
@@ -21,23 +20,17 @@ std::string_view logLevelName(int level) {
 }
 
 namespace {
-std::mutex gSinkMutex;
-LogSink gSink;  // guarded by gSinkMutex; empty means standard error
+detail::LogSinkSlot& slot() {
+  static detail::LogSinkSlot* const instance = new detail::LogSinkSlot();  // outlives every logger
+  return *instance;
+}
 }  // namespace
 
-LogSink setInstallerLogSink(LogSink sink) {
-  std::lock_guard lock(gSinkMutex);
-  return std::exchange(gSink, std::move(sink));
-}
+LogSink setInstallerLogSink(LogSink sink) { return slot().exchange(std::move(sink)); }
 
 void installerLogWrite(const InstallerLogHandle* /*handle*/, int level, const char* function,
                        std::string_view message) {
-  LogRecord record{level, "installer", function ? function : "", "", 0, message};
-  std::lock_guard lock(gSinkMutex);
-  if (gSink)
-    gSink(record);
-  else
-    detail::writeRecordToStandardError(record);
+  slot().write(LogRecord{level, "installer", function ? function : "", "", 0, message});
 }
 
 }  // namespace sl

@@ -62,6 +62,7 @@
 #include <utility>
 #include <vector>
 
+#include "Platform/DirectoryEntries.h"
 #include "Platform/UniqueFd.h"
 
 struct sl::removefile_state {
@@ -87,11 +88,10 @@ constexpr size_t kMaxOpenLevels = 32;
 // What an entry of a listing is taken to be before it is touched.
 enum class Kind { kDirectory, kOther };
 
-struct Entry {
-  std::string name;
-  Kind kind;
-  bool kindKnown;  // false: the listing left the type unknown (DT_UNKNOWN)
-};
+using Entry = DirectoryEntry;
+
+// What the listing says an entry is; only asked when its type is known.
+Kind kindOf(const Entry& entry) { return entry.type == DT_DIR ? Kind::kDirectory : Kind::kOther; }
 
 // One directory on the way down from the top item.
 struct Level {
@@ -108,25 +108,6 @@ enum class Step { kGoOn, kStop };
 
 // What one attempt at an entry came to.
 enum class Attempt { kDone, kWrongKind, kFailed };
-
-// Reads the entries of the directory open at fd, "." and ".." left out.
-// Returns 0, or the errno of the failure. fd itself stays open: the stream
-// works on a duplicate.
-int listDirectory(int fd, std::vector<Entry>& entries) {
-  UniqueFd dup(fcntl(fd, F_DUPFD_CLOEXEC, 0));
-  if (!dup) return errno;
-  UniqueDir dir = sl::fdopendir(dup);
-  if (!dir) return errno;
-  for (;;) {
-    errno = 0;
-    const dirent* entry = readdir(dir.get());
-    if (entry == nullptr) return errno;  // 0 at the end of the stream
-    const char* name = entry->d_name;
-    if (name[0] == '.' && (name[1] == '\0' || (name[1] == '.' && name[2] == '\0'))) continue;
-    bool known = entry->d_type != DT_UNKNOWN;
-    entries.push_back(Entry{name, entry->d_type == DT_DIR ? Kind::kDirectory : Kind::kOther, known});
-  }
-}
 
 class Walk {
  public:
@@ -145,7 +126,7 @@ class Walk {
       if (level.next < level.entries.size()) {
         // handleEntry may push a level: work on a copy of the entry.
         Entry entry = std::move(level.entries[level.next++]);
-        Step step = entry.kindKnown ? handleEntry(level.fd.get(), entry.name, entry.kind)
+        Step step = entry.type != DT_UNKNOWN ? handleEntry(level.fd.get(), entry.name, kindOf(entry))
                                     : handleUnknownEntry(level.fd.get(), entry.name);
         if (step == Step::kStop) return -1;
         continue;
@@ -235,7 +216,7 @@ class Walk {
       err = errno;
       return removeIfEmpty(dirFd, name);
     }
-    err = listDirectory(fd.get(), entries);
+    err = readDirectoryEntries(fd.get(), entries);
     if (err != 0) {
       fd.reset();
       return removeIfEmpty(dirFd, name);
