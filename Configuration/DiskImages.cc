@@ -16,10 +16,10 @@
 
 namespace {
 
-constexpr char kDiskImageControllerClass[] = "DVQVAMController";
-constexpr char kDiskImageDriveClass[] = "DVQVAMHDDrive";
-constexpr char kMediaClass[] = "DVMedia";
-constexpr char kBSDNameKey[] = "BSD Name";
+constexpr const char* kDiskImageControllerClass = sl::kDVDiskImageControllerClass;
+constexpr const char* kDiskImageDriveClass = sl::kDVDiskImageDriveClass;
+constexpr const char* kMediaClass = sl::kDVMediaClass;
+constexpr const char* kBSDNameKey = sl::kDVBSDNameKey;
 constexpr char kDebugMountPrefix[] = "/private/var/debug_mount";
 
 // Owns one registry handle (entry or iterator) and releases it when the

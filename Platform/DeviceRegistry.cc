@@ -40,10 +40,10 @@ namespace {
 constexpr char kDefaultSysfsRoot[] = "/sys";
 constexpr char kDefaultMountInfoPath[] = "/proc/self/mountinfo";
 
-constexpr char kControllerClass[] = "DVQVAMController";
-constexpr char kDriveClass[] = "DVQVAMHDDrive";
-constexpr char kMediaClass[] = "DVMedia";
-constexpr char kBSDNameKey[] = "BSD Name";
+constexpr const char* kControllerClass = kDVDiskImageControllerClass;
+constexpr const char* kDriveClass = kDVDiskImageDriveClass;
+constexpr const char* kMediaClass = kDVMediaClass;
+constexpr const char* kBSDNameKey = kDVBSDNameKey;
 
 enum class Kind : uint8_t { Controller, Drive, WholeMedium, Partition };
 

@@ -43,6 +43,10 @@ inline constexpr dv_return_t kDVReturnNoMemory = static_cast<dv_return_t>(0xE000
 inline constexpr dv_return_t kDVReturnBadArgument = static_cast<dv_return_t>(0xE00002C2);
 
 inline constexpr char kDVServicePlane[] = "DVService";
+inline constexpr char kDVDiskImageControllerClass[] = "DVQVAMController";
+inline constexpr char kDVDiskImageDriveClass[] = "DVQVAMHDDrive";
+inline constexpr char kDVMediaClass[] = "DVMedia";
+inline constexpr char kDVBSDNameKey[] = "BSD Name";
 inline constexpr uint32_t kDVRegistryIterateRecursively = 0x00000001;
 
 // Where the layer reads sysfs ("/sys" by default; it looks at
