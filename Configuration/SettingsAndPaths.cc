@@ -16,6 +16,7 @@
 
 #include "Configuration/SLGlobalConfiguration.h"
 #include "FileManager/SLFileManager.h"
+#include "Platform/CodeSigning.h"
 #include "Platform/Error.h"
 #include "Platform/Preferences.h"
 #include "Platform/SystemRoot.h"
@@ -38,9 +39,6 @@ constexpr mode_t kDirectoryMode = 0755;
 constexpr int32_t kNoProtectionClass = -1;
 constexpr int32_t kWorkingDirectoryProtectionClass = 4;
 
-// The system's code-signing status query for the calling process. Linux
-// enforces no code signing, so enforcement is always off here.
-bool processCodeSigningEnforcementIsDisabled() { return true; }
 
 sl::URL directoryBelow(const sl::URL& base, std::string_view component) {
   return base.URLByAppendingPathComponent(component, true);
@@ -102,7 +100,7 @@ SLGlobalConfiguration::SLGlobalConfiguration() {
 
 bool SLGlobalConfiguration::codeSigningEnforcementIsDisabled() {
   std::call_once(_codeSigningOnce,
-                 [this] { _codeSigningEnforcementIsDisabled = processCodeSigningEnforcementIsDisabled(); });
+                 [this] { _codeSigningEnforcementIsDisabled = sl::codeSigningEnforcementIsDisabledForOwnProcess(); });
   return _codeSigningEnforcementIsDisabled;
 }
 
