@@ -39,7 +39,6 @@ constexpr mode_t kDirectoryMode = 0755;
 constexpr int32_t kNoProtectionClass = -1;
 constexpr int32_t kWorkingDirectoryProtectionClass = 4;
 
-
 sl::URL directoryBelow(const sl::URL& base, std::string_view component) {
   return base.URLByAppendingPathComponent(component, true);
 }
