@@ -19,15 +19,13 @@
 
 namespace {
 
-using sl::test::LogCapture;
-using Lines = std::vector<LogCapture::Line>;
+using sl::test::fileURL;
+using sl::test::installerLine;
+using Lines = std::vector<sl::test::LogCapture::Line>;
 using IDs = std::set<std::string>;
 
 constexpr char kScan[] = "-[SLGlobalConfiguration _bundleIDMapForBundlesInDirectory:withExtension:]";
 constexpr char kBundleURLKey[] = "com.vantor.Stowline.bundleURL";
-
-sl::URL dirURL(const std::string& path) { return sl::URL::fileURLWithPath(path, true); }
-LogCapture::Line debug(const std::string& message) { return {sl::kLogLevelDebug, "installer", kScan, message}; }
 
 IDs keysOf(const sl::Dictionary& catalogue) {
   IDs out;
@@ -53,7 +51,7 @@ class BundleCatalogues : public ::testing::Test {
     if (identifier != nullptr) info.set("PBBundleIdentifier", sl::String(identifier));
     if (version != nullptr) info.set("PBBundleVersion", sl::String(version));
     sl::test::makeDirs(root_ / relative);
-    ASSERT_TRUE(sl::writePropertyListToURL(info, sl::URL::fileURLWithPath(root_ / relative + "/Info.plist", false)));
+    ASSERT_TRUE(sl::writePropertyListToURL(info, fileURL(root_ / relative + "/Info.plist")));
   }
 
   sl::test::TempDir root_;
@@ -72,33 +70,32 @@ TEST_F(BundleCatalogues, ScanRulesAndCaching) {
   sl::test::makeSymlink(root_ / "elsewhere/Linked.app", root_ / "Applications/Linked.app");
   sl::test::makeDirs(root_ / "Applications/NoPlist.app");
   const std::string apps = config_->systemAppsDirectory().path();
-
-  LogCapture log;
   // Of the two bundles with one identifier, the one listed later wins.
   std::string later;
-  const auto listing = SLFileManager::defaultManager().urlsForItemsInDirectoryAtURL(dirURL(apps), true);
+  const auto listing = SLFileManager::defaultManager().urlsForItemsInDirectoryAtURL(fileURL(apps, true), true);
   ASSERT_TRUE(listing);
   for (const sl::URL& url : *listing) {
     if (url.lastPathComponent() == "B.app" || url.lastPathComponent() == "C.app") later = url.lastPathComponent();
   }
-  log.clear();
 
+  sl::test::LogCapture log;
   const sl::Dictionary catalogue = config_->systemAppBundleIDToInfoMap();
   EXPECT_EQ(keysOf(catalogue), (IDs{"com.example.a", "com.example.dup"}));
   EXPECT_EQ(catalogue.get("com.example.a"), (sl::Dictionary{{"PBBundleIdentifier", sl::String("com.example.a")},
                                                             {"PBBundleVersion", sl::String("1.0")},
-                                                            {kBundleURLKey, dirURL(apps + "/A.app")}}));
-  EXPECT_EQ(catalogue.get("com.example.dup").asDictionary().get(kBundleURLKey), dirURL(apps + "/" + later));
-  const std::string noPlist = dirURL(apps + "/NoPlist.app").absoluteString();
-  EXPECT_THAT(log.installer(),
-              ::testing::UnorderedElementsAreArray(Lines{
-                  {sl::kLogLevelNotice, "installer",
-                   "-[SLFileManager urlsForItemsInDirectoryAtURL:ignoringSymlinks:error:]",
-                   "Ignoring symlink at " + apps + "/Linked.app"},
-                  {sl::kLogLevelDebug, "installer", "SLLoadInfoPlist", "Missing Info.plist at " + noPlist + "Info.plist"},
-                  debug("Failed to load Info.plist from bundle " + noPlist),
-                  debug("Failed to get PBBundleIdentifier from bundle " +
-                        dirURL(apps + "/NoIdentifier.app").absoluteString())}));
+                                                            {kBundleURLKey, fileURL(apps + "/A.app", true)}}));
+  EXPECT_EQ(catalogue.get("com.example.dup").asDictionary().get(kBundleURLKey), fileURL(apps + "/" + later, true));
+  const std::string noPlist = fileURL(apps + "/NoPlist.app", true).absoluteString();
+  EXPECT_THAT(
+      log.installer(),
+      ::testing::UnorderedElementsAreArray(Lines{
+          installerLine(sl::kLogLevelNotice, "-[SLFileManager urlsForItemsInDirectoryAtURL:ignoringSymlinks:error:]",
+                        "Ignoring symlink at " + apps + "/Linked.app"),
+          installerLine(sl::kLogLevelDebug, "SLLoadInfoPlist", "Missing Info.plist at " + noPlist + "Info.plist"),
+          installerLine(sl::kLogLevelDebug, kScan, "Failed to load Info.plist from bundle " + noPlist),
+          installerLine(sl::kLogLevelDebug, kScan,
+                        "Failed to get PBBundleIdentifier from bundle " +
+                            fileURL(apps + "/NoIdentifier.app", true).absoluteString())}));
 
   // ---- Cached until reScanSystemApps; the other rescans leave it ----
   bundle("Applications/New.app", "com.example.new");
@@ -106,24 +103,51 @@ TEST_F(BundleCatalogues, ScanRulesAndCaching) {
   config_->reScanInternalApps();
   EXPECT_EQ(keysOf(config_->systemAppBundleIDToInfoMap()), keysOf(catalogue));
   config_->reScanSystemApps();
-  EXPECT_EQ(keysOf(config_->systemAppBundleIDToInfoMap()), (IDs{"com.example.a", "com.example.dup", "com.example.new"}));
+  EXPECT_EQ(keysOf(config_->systemAppBundleIDToInfoMap()),
+            (IDs{"com.example.a", "com.example.dup", "com.example.new"}));
   EXPECT_EQ(keysOf(catalogue), (IDs{"com.example.a", "com.example.dup"}));  // what was handed out stays
 }
 
-TEST_F(BundleCatalogues, MissingAndUnreadableDirectories) {
-  // ---- Missing: null, silent, and scanned again on the next call ----
-  LogCapture log;
+TEST_F(BundleCatalogues, OtherCataloguesFrameworksAndFailures) {
+  bundle("Applications/S.app", "com.example.system");
+  bundle("Applications/Both.app", "com.example.both");
+  bundle("System/Library/Basalt/Core.app", "com.example.core");
+  bundle("System/Library/Basalt/Both.app", "com.example.both");
+  sl::test::LogCapture log;
+
+  // ---- Missing directories: null (the framework set empty), silent; the
+  // catalogue is scanned again on the next call, the framework set is not ----
   EXPECT_TRUE(config_->internalAppBundleIDToInfoMap().isNull());
-  bundle("VantorInternal/Applications/I.app", "com.example.internal");
-  EXPECT_EQ(keysOf(config_->internalAppBundleIDToInfoMap()), IDs{"com.example.internal"});
+  EXPECT_EQ(config_->builtInFrameworkBundleIDs(), IDs{});
   EXPECT_EQ(log.installer(), Lines{});
+  bundle("VantorInternal/Applications/I.app", "com.example.internal");
+  bundle("System/Library/Frameworks/X.framework", "com.example.x");
+  EXPECT_EQ(keysOf(config_->internalAppBundleIDToInfoMap()), IDs{"com.example.internal"});
+  EXPECT_EQ(config_->builtInFrameworkBundleIDs(), IDs{});
+  config_->reScanSystemApps();
+  EXPECT_EQ(config_->builtInFrameworkBundleIDs(), IDs{"com.example.x"});
+  bundle("VantorInternal/PrivateFrameworks/Y.framework", "com.example.y");
+  config_->reScanBasaltApps();
+  EXPECT_EQ(config_->builtInFrameworkBundleIDs(), IDs{"com.example.x"});
+  config_->reScanInternalApps();
+  EXPECT_EQ(config_->builtInFrameworkBundleIDs(), (IDs{"com.example.x", "com.example.y"}));
+
+  // ---- Disk images (without any, the developer applications alone; empty,
+  // never null) and the built-in set, which leaves the basalt ones out ----
+  EXPECT_EQ(config_->diskImageAppBundleIDToInfoMap(), sl::Dictionary::create());
+  bundle("Developer/Applications/D.app", "com.example.developer");
+  EXPECT_EQ(keysOf(config_->diskImageAppBundleIDToInfoMap()), IDs{"com.example.developer"});
+  EXPECT_EQ(keysOf(config_->basaltAppBundleIDToInfoMap()), (IDs{"com.example.core", "com.example.both"}));
+  EXPECT_EQ(config_->builtInApplicationBundleIDs(),
+            (IDs{"com.example.system", "com.example.both", "com.example.internal", "com.example.developer"}));
 
   // ---- Any other listing failure: null, one error line, not cached ----
-  bundle("Applications/S.app", "com.example.system");
+  config_->reScanSystemApps();
   ASSERT_EQ(chmod((root_ / "Applications").c_str(), 0700), 0);
   const sl::URL apps = config_->systemAppsDirectory();
   sl::Dictionary catalogue;
   sl::Error expected;
+  log.clear();
   {
     sl::test::ScopedUnprivileged nobody;
     ASSERT_FALSE(SLFileManager::defaultManager().urlsForItemsInDirectoryAtURL(apps, true, &expected));
@@ -131,62 +155,33 @@ TEST_F(BundleCatalogues, MissingAndUnreadableDirectories) {
   }
   EXPECT_TRUE(catalogue.isNull());
   EXPECT_TRUE(expected.isPOSIX(EACCES));
-  EXPECT_EQ(log.installer(), (Lines{{sl::kLogLevelError, "installer", kScan,
-                                     sl::format("Failed to search for apps in %@ : %@", apps, expected)}}));
-  EXPECT_EQ(keysOf(config_->systemAppBundleIDToInfoMap()), IDs{"com.example.system"});
+  EXPECT_EQ(log.installer(),
+            (Lines{installerLine(sl::kLogLevelError, kScan,
+                                 sl::format("Failed to search for apps in %@ : %@", apps, expected))}));
+  EXPECT_EQ(keysOf(config_->systemAppBundleIDToInfoMap()), (IDs{"com.example.system", "com.example.both"}));
 }
 
-TEST_F(BundleCatalogues, FrameworkSetIsCachedEvenWhenEmptyUntilARescan) {
-  EXPECT_EQ(config_->builtInFrameworkBundleIDs(), IDs{});
-  bundle("System/Library/Frameworks/X.framework", "com.example.x");
-  bundle("System/Library/Frameworks/NotAFramework.app", "com.example.app");
-  EXPECT_EQ(config_->builtInFrameworkBundleIDs(), IDs{});
-  config_->reScanSystemApps();
-  EXPECT_EQ(config_->builtInFrameworkBundleIDs(), IDs{"com.example.x"});
-
-  bundle("VantorInternal/PrivateFrameworks/Y.framework", "com.example.y");
-  config_->reScanBasaltApps();
-  EXPECT_EQ(config_->builtInFrameworkBundleIDs(), IDs{"com.example.x"});
-  config_->reScanInternalApps();
-  EXPECT_EQ(config_->builtInFrameworkBundleIDs(), (IDs{"com.example.x", "com.example.y"}));
-}
-
-TEST_F(BundleCatalogues, BuiltInApplicationsAndDiskImages) {
-  bundle("Applications/S.app", "com.example.system");
-  bundle("Applications/Both.app", "com.example.both");
-  bundle("VantorInternal/Applications/I.app", "com.example.internal");
-  bundle("Developer/Applications/D.app", "com.example.developer");
-  bundle("System/Library/Basalt/Core.app", "com.example.core");
-  bundle("System/Library/Basalt/Both.app", "com.example.both");
-  LogCapture log;  // diskImageApplicationsDirectories writes a debug line
-
-  // Without disk images, the developer applications directory alone.
-  const sl::Dictionary diskImages = config_->diskImageAppBundleIDToInfoMap();
-  EXPECT_EQ(keysOf(diskImages), IDs{"com.example.developer"});
-  EXPECT_EQ(diskImages.get("com.example.developer").asDictionary().get(kBundleURLKey),
-            dirURL(root_ / "Developer/Applications/D.app"));
-  EXPECT_EQ(keysOf(config_->basaltAppBundleIDToInfoMap()), (IDs{"com.example.core", "com.example.both"}));
-  EXPECT_EQ(config_->builtInApplicationBundleIDs(),
-            (IDs{"com.example.system", "com.example.both", "com.example.internal", "com.example.developer"}));
-
-  sl::test::forceRemove(root_ / "Developer");
-  EXPECT_EQ(config_->diskImageAppBundleIDToInfoMap(), sl::Dictionary::create());  // empty, never null
-}
-
-TEST_F(BundleCatalogues, ConcurrentFirstCallsShareOneScan) {
+TEST_F(BundleCatalogues, ConcurrentFirstCalls) {
   for (int i = 0; i < 20; ++i) bundle("Applications/" + std::to_string(i) + ".app", std::to_string(i).c_str());
   const uint64_t loadsBefore = sl::infoplist_detail::lockAcquisitionCount();
+  sl::test::LogCapture log;
+  SLGlobalConfiguration* shared[2] = {};
+  sl::URL data[2];
   sl::Dictionary seen[2];
   std::latch start(2);
   auto ask = [&](int i) {
     start.arrive_and_wait();
+    shared[i] = &SLGlobalConfiguration::sharedInstance();
+    data[i] = config_->dataDirectory();
     seen[i] = config_->systemAppBundleIDToInfoMap();
   };
-  std::thread first(ask, 0), second(ask, 1);
-  first.join();
-  second.join();
+  { std::jthread first(ask, 0), second(ask, 1); }
+  EXPECT_EQ(shared[0], shared[1]);
+  EXPECT_EQ(data[0], data[1]);
+  EXPECT_TRUE(sl::test::exists(data[0].path()));
   EXPECT_EQ(seen[0].count(), 20u);
   EXPECT_EQ(seen[0], seen[1]);
+  EXPECT_EQ(log.installer(), Lines{});  // neither creation failed
   // The scan runs under the object lock: whichever caller comes second waits
   // for the first one's catalogue instead of loading every bundle again.
   EXPECT_EQ(sl::infoplist_detail::lockAcquisitionCount(), loadsBefore + 20);

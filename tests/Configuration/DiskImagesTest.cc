@@ -18,7 +18,6 @@ namespace {
 
 using sl::test::LogCapture;
 using sl::test::TempDir;
-using Lines = std::vector<LogCapture::Line>;
 using Paths = std::vector<std::string>;
 
 // A system root of its own, a made-up sysfs tree and mount table, and a log
@@ -71,12 +70,10 @@ TEST(DiskImages, MountPointsAndApplicationsDirectories) {
 
   // No loop device: no controller, just the developer directory, no error.
   EXPECT_TRUE(configuration.diskImageMountPoints().empty());
-  std::vector<sl::URL> directories = configuration.diskImageApplicationsDirectories();
-  EXPECT_EQ(paths(directories), Paths{developerApps});
-  const sl::Array returned{sl::URL::fileURLWithPath(developerApps, true)};
-  EXPECT_EQ(log.installer(), (Lines{{sl::kLogLevelDebug, "installer",
-                                     "-[SLGlobalConfiguration diskImageApplicationsDirectories]",
-                                     sl::format("returning: %@", returned)}}));
+  EXPECT_EQ(paths(configuration.diskImageApplicationsDirectories()), Paths{developerApps});
+  EXPECT_EQ(log.installer(), std::vector{sl::test::installerLine(
+                                 sl::kLogLevelDebug, "-[SLGlobalConfiguration diskImageApplicationsDirectories]",
+                                 sl::format("returning: %@", sl::Array{sl::test::fileURL(developerApps, true)}))});
 
   // loop1 has only its partition mounted (/dev/loop10 is not loop1, and the
   // blank comes escaped); loop2 and loop3 sit at the debug mount; loop4 is
@@ -84,30 +81,32 @@ TEST(DiskImages, MountPointsAndApplicationsDirectories) {
   // The developer directory comes last.
   for (int n : {2, 3, 4, 5}) world.attach(n);
   world.attach(1, true);
-  world.mount({{"/dev/loop10", "/mnt/ten"}, {"/dev/loop1p1", "/Volumes/My\\040Img"},
-               {"/dev/loop2", "/private/var/debug_mount"}, {"/dev/loop3", "/private/var/debug_mount2"},
-               {"/dev/loop5", "/mnt/first"}, {"/dev/loop5", "/mnt/second"}});
+  world.mount({{"/dev/loop10", "/mnt/ten"},
+               {"/dev/loop1p1", "/Volumes/My\\040Img"},
+               {"/dev/loop2", "/private/var/debug_mount"},
+               {"/dev/loop3", "/private/var/debug_mount2"},
+               {"/dev/loop5", "/mnt/first"},
+               {"/dev/loop5", "/mnt/second"}});
   log.clear();
   EXPECT_EQ(paths(configuration.diskImageMountPoints()),
             (Paths{"/Volumes/My Img", "/private/var/debug_mount", "/private/var/debug_mount2", "/mnt/first"}));
-  directories = configuration.diskImageApplicationsDirectories();
-  EXPECT_EQ(paths(directories), (Paths{"/Volumes/My Img/Applications", "/mnt/first/Applications", developerApps}));
+  EXPECT_EQ(paths(configuration.diskImageApplicationsDirectories()),
+            (Paths{"/Volumes/My Img/Applications", "/mnt/first/Applications", developerApps}));
   EXPECT_EQ(log.installer().size(), 1u);  // just "returning: ..."
 
   // An image mounted on the developer root gives the developer directory,
   // held once, in mount order.
   world.attach(0);
   world.mount({{"/dev/loop0", world.root + "/Developer"}, {"/dev/loop5", "/mnt/first"}});
-  EXPECT_EQ(paths(configuration.diskImageApplicationsDirectories()),
-            (Paths{developerApps, "/mnt/first/Applications"}));
+  EXPECT_EQ(paths(configuration.diskImageApplicationsDirectories()), (Paths{developerApps, "/mnt/first/Applications"}));
 
   // Unreadable mount table: one error line per drive asked (loop0 to loop5).
   sl::test::forceRemove(world.mountInfo);
   log.clear();
   EXPECT_TRUE(configuration.diskImageMountPoints().empty());
-  const LogCapture::Line failed{sl::kLogLevelError, "installer", "-[SLGlobalConfiguration mountPointForDevice:]",
-                                "getmntinfo failed: No such file or directory"};
-  EXPECT_EQ(log.installer(), Lines(6, failed));
+  EXPECT_EQ(log.installer(),
+            std::vector(6, sl::test::installerLine(sl::kLogLevelError, "-[SLGlobalConfiguration mountPointForDevice:]",
+                                                   "getmntinfo failed: No such file or directory")));
   EXPECT_EQ(sl::dvOutstandingHandles(), handlesBefore);
 }
 
@@ -146,8 +145,7 @@ TEST(DiskImages, RealLoopDevice) {
   RunAtExit unmount{"umount " + mountPoint};  // runs before the detach
 
   sl::setSystemRoot(dir.path());
-  SLGlobalConfiguration configuration;
-  Paths mountPoints = paths(configuration.diskImageMountPoints());
+  const Paths mountPoints = paths(SLGlobalConfiguration().diskImageMountPoints());
   sl::setSystemRoot("");
   EXPECT_NE(std::find(mountPoints.begin(), mountPoints.end(), mountPoint), mountPoints.end()) << *device;
 }

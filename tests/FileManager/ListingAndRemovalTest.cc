@@ -1,69 +1,54 @@
 #include <fcntl.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <map>
-#include <thread>
-#include <vector>
 
 #include <gtest/gtest.h>
 
 #include "FileManager/SLFileManager.h"
 #include "Platform/UniqueFd.h"
-#include "Support/Errors.h"
 #include "TestSupport/TestSupport.h"
+
+namespace sl {
+// Called after each directory of a removal walk has been listed (Platform/Removefile.cc).
+extern void (*removefile_test_hook_after_listing)(int dirFd, const char* path);
+}  // namespace sl
 
 namespace {
 
-using sl::test::LogCapture;
-using sl::test::ScopedUnprivileged;
-using sl::test::TempDir;
+using namespace sl::test;
 using Lines = std::vector<LogCapture::Line>;
 
 constexpr char kRemove[] = "-[SLFileManager removeItemAtURL:error:]";
 constexpr char kCallback[] = "_removefile_error_callback";
 constexpr char kList[] = "-[SLFileManager urlsForItemsInDirectoryAtURL:ignoringSymlinks:error:]";
-constexpr char kExists[] = "-[SLFileManager itemExistsAtURL:]";
-constexpr char kDoesNotExist[] = "-[SLFileManager itemDoesNotExistAtURL:]";
 
 SLFileManager& fm() { return SLFileManager::defaultManager(); }
-sl::URL fileURL(const std::string& path, bool isDirectory = false) {
-  return sl::URL::fileURLWithPath(path, isDirectory);
-}
-LogCapture::Line line(int level, const char* function, const std::string& message) {
-  return {level, "installer", function, message};
-}
+std::string gVanishingIn;  // the directory whose entry "gone" the hook removes once it is listed
 
-void expectPOSIXRecord(const sl::Error& err, int code, const std::string& message, const char* function) {
-  ASSERT_FALSE(err.isNull());
-  EXPECT_EQ(err.domain(), sl::kPOSIXErrorDomain);
-  EXPECT_EQ(err.code(), code);
-  EXPECT_EQ(err.localizedDescription().str(), message);
-  EXPECT_EQ(err.userInfo().get(SLFunctionNameErrorKey).asString().str(), function);
-  EXPECT_TRUE(err.userInfo().contains(SLSourceFileLineErrorKey));
-}
-
-// name -> isDirectory, so that the stream's order does not matter.
-std::map<std::string, bool> byName(const std::vector<sl::URL>& urls) {
-  std::map<std::string, bool> out;
-  for (const sl::URL& url : urls) out[url.lastPathComponent()] = url.isDirectory();
-  return out;
-}
-
-TEST(ListingAndRemoval, RemoveTreesLinksAbsentAndNull) {
+TEST(ListingAndRemoval, RemoveTreesLinksVanishedAbsentAndNull) {
   TempDir tmp;
-  sl::test::writeFile(tmp / "outside/keep", "kept");
-  sl::test::writeFile(tmp / "tree/a/b/file");
-  sl::test::makeSymlink(tmp / "outside", tmp / "tree/linkToDir");
-  sl::test::makeSymlink(tmp / "outside/keep", tmp / "tree/a/linkToFile");
+  writeFile(tmp / "outside/keep", "kept");
+  writeFile(tmp / "tree/a/b/file");
+  writeFile(tmp / "tree/gone");
+  makeSymlink(tmp / "outside", tmp / "tree/linkToDir");
+  makeSymlink(tmp / "outside/keep", tmp / "tree/a/linkToFile");
   LogCapture log;
   sl::Error err;
 
-  // Links go, never what they point at.
-  EXPECT_TRUE(fm().removeItemAtURL(fileURL(tmp / "tree", true), &err)) << err.description();
-  EXPECT_TRUE(err.isNull());
-  EXPECT_FALSE(sl::test::exists(tmp / "tree"));
-  EXPECT_EQ(sl::test::readFile(tmp / "outside/keep"), "kept");
+  // Links go, never what they point at; an entry that vanishes under the
+  // walk is neither a failure nor worth a line.
+  gVanishingIn = tmp / "tree";
+  sl::removefile_test_hook_after_listing = [](int fd, const char* path) {
+    if (path == gVanishingIn) {
+      EXPECT_EQ(unlinkat(fd, "gone", 0), 0);
+    }
+  };
+  const bool removed = fm().removeItemAtURL(fileURL(tmp / "tree", true), &err);
+  sl::removefile_test_hook_after_listing = nullptr;
+  EXPECT_TRUE(removed) << err.description();
+  EXPECT_FALSE(exists(tmp / "tree"));
+  EXPECT_EQ(readFile(tmp / "outside/keep"), "kept");
 
   // Nothing there: success, and the slot keeps what the caller put in it.
   const sl::Error sentinel("Sentinel", 42);
@@ -81,8 +66,8 @@ TEST(ListingAndRemoval, RemoveUnreadableSubdirectoryFailsWithFirstError) {
   // box and tree belong to nobody, so nobody may remove what they hold;
   // locked is root's 0700, so nobody can neither read nor empty it.
   const std::string tree = tmp / "box/tree";
-  sl::test::writeFile(tree + "/file");
-  sl::test::writeFile(tree + "/locked/inner");
+  writeFile(tree + "/file");
+  writeFile(tree + "/locked/inner");
   ASSERT_EQ(chmod((tree + "/locked").c_str(), 0700), 0);
   for (const std::string& p : {tmp / "box", tree})
     ASSERT_EQ(lchown(p.c_str(), ScopedUnprivileged::kUid, ScopedUnprivileged::kGid), 0);
@@ -94,14 +79,12 @@ TEST(ListingAndRemoval, RemoveUnreadableSubdirectoryFailsWithFirstError) {
   }
   expectPOSIXRecord(err, EACCES, "removefile of file://" + tree + "/ failed: Permission denied", kRemove);
   // locked is reported once, with why it could not be entered; its parent
-  // then cannot be removed either.
-  EXPECT_EQ(log.installer(), (Lines{
-                                 line(3, kCallback, "removefile hit error for " + tree + "/locked : Permission denied"),
-                                 line(3, kCallback, "removefile hit error for " + tree + " : Directory not empty"),
-                             }));
-  // The walk went on past the failure.
-  EXPECT_FALSE(sl::test::exists(tree + "/file"));
-  EXPECT_TRUE(sl::test::exists(tree + "/locked/inner"));
+  // then cannot be removed either. The walk went on past the failure.
+  EXPECT_EQ(log.installer(),
+            (Lines{installerLine(3, kCallback, "removefile hit error for " + tree + "/locked : Permission denied"),
+                   installerLine(3, kCallback, "removefile hit error for " + tree + " : Directory not empty")}));
+  EXPECT_FALSE(exists(tree + "/file"));
+  EXPECT_TRUE(exists(tree + "/locked/inner"));
 }
 
 TEST(ListingAndRemoval, RemoveDeepTree) {
@@ -117,89 +100,66 @@ TEST(ListingAndRemoval, RemoveDeepTree) {
   fd.reset();
   sl::Error err;
   EXPECT_TRUE(fm().removeItemAtURL(fileURL(shm / "d", true), &err)) << err.description();
-  EXPECT_FALSE(sl::test::exists(shm / "d"));
+  EXPECT_FALSE(exists(shm / "d"));
 }
 
-TEST(ListingAndRemoval, ListOneLevel) {
-  TempDir tmp;
-  const std::string dir = tmp / "dir";
-  const std::string odd = "odd\xff\xfe";  // not UTF-8
-  sl::test::writeFile(dir + "/file");
-  sl::test::writeFile(dir + "/sub/inner");
-  sl::test::writeFile(dir + "/" + odd, "bytes");
-  sl::test::makeSymlink(dir + "/sub", dir + "/linkToSub");
-  sl::test::makeDirs(tmp / "empty");
-  LogCapture log;
-
-  // Links kept: listed as non-directories and not followed.
-  auto all = fm().urlsForItemsInDirectoryAtURL(fileURL(dir, true), false);
-  ASSERT_TRUE(all);
-  EXPECT_EQ(byName(*all), (std::map<std::string, bool>{{"file", false}, {"linkToSub", false}, {odd, false}, {"sub", true}}));
-  for (const sl::URL& url : *all) {
-    if (url.lastPathComponent() == odd) {
-      EXPECT_EQ(sl::test::readFile(url.path()), "bytes");
-    }
+// name -> isDirectory, so that the stream's order does not matter.
+std::map<std::string, bool> listing(const std::string& dir, bool ignoringSymlinks) {
+  std::map<std::string, bool> out;
+  const auto urls = fm().urlsForItemsInDirectoryAtURL(fileURL(dir, true), ignoringSymlinks);
+  EXPECT_TRUE(urls) << dir;
+  for (const sl::URL& url : urls.value_or(std::vector<sl::URL>{})) {
+    EXPECT_TRUE(exists(url.path())) << url.path();
+    out[url.lastPathComponent()] = url.isDirectory();
   }
-  EXPECT_EQ(log.installer(), Lines{});
-
-  // Links left out, one notice each.
-  auto noLinks = fm().urlsForItemsInDirectoryAtURL(fileURL(dir, true), true);
-  ASSERT_TRUE(noLinks);
-  EXPECT_EQ(byName(*noLinks), (std::map<std::string, bool>{{"file", false}, {odd, false}, {"sub", true}}));
-  EXPECT_EQ(log.installer(), Lines{line(5, kList, "Ignoring symlink at " + dir + "/linkToSub")});
-
-  auto empty = fm().urlsForItemsInDirectoryAtURL(fileURL(tmp / "empty", true), false);
-  ASSERT_TRUE(empty);
-  EXPECT_TRUE(empty->empty());
+  return out;
 }
 
-TEST(ListingAndRemoval, ListRefusesLinksAndFiles) {
+TEST(ListingAndRemoval, ListingAndExistence) {
   TempDir tmp;
-  sl::test::makeDirs(tmp / "dir");
-  sl::test::makeSymlink(tmp / "dir", tmp / "link");
-  sl::test::writeFile(tmp / "file");
+  const std::string dir = tmp / "dir", odd = "odd\xff\xfe";  // not UTF-8
+  writeFile(dir + "/file");
+  writeFile(dir + "/sub/inner");
+  writeFile(dir + "/" + odd);
+  makeSymlink(dir + "/sub", dir + "/linkToSub");
+  makeSymlink(dir, tmp / "link");
+  makeSymlink(tmp / "nowhere", tmp / "dangling");
+  makeDirs(tmp / "empty");
+  makeDirs(tmp / "locked/child", 0700);  // root's: nobody cannot search it
   LogCapture log;
-  sl::Error err;
 
-  // Not followed: with O_NOFOLLOW|O_DIRECTORY Linux refuses a link as a
-  // non-directory.
+  // Links kept (listed as non-directories and not followed), or left out
+  // with one notice each.
+  EXPECT_EQ(listing(dir, false),
+            (std::map<std::string, bool>{{"file", false}, {"linkToSub", false}, {odd, false}, {"sub", true}}));
+  EXPECT_EQ(listing(tmp / "empty", false), (std::map<std::string, bool>{}));
+  EXPECT_EQ(log.installer(), Lines{});
+  EXPECT_EQ(listing(dir, true), (std::map<std::string, bool>{{"file", false}, {odd, false}, {"sub", true}}));
+  EXPECT_EQ(log.installer(), Lines{installerLine(5, kList, "Ignoring symlink at " + dir + "/linkToSub")});
+  log.clear();
+
+  // With O_NOFOLLOW|O_DIRECTORY Linux refuses a link as a non-directory.
+  sl::Error err;
   EXPECT_FALSE(fm().urlsForItemsInDirectoryAtURL(fileURL(tmp / "link", true), false, &err));
   expectPOSIXRecord(err, ENOTDIR, "_IterateDirectory for " + tmp / "link" + " returned Not a directory", kList);
-  EXPECT_FALSE(fm().urlsForItemsInDirectoryAtURL(fileURL(tmp / "file"), false, &err));
-  expectPOSIXRecord(err, ENOTDIR, "_IterateDirectory for " + tmp / "file" + " returned Not a directory", kList);
-  EXPECT_EQ(log.installer(), Lines{});
-}
+  EXPECT_FALSE(fm().urlsForItemsInDirectoryAtURL(fileURL(dir + "/file"), false, &err));
+  expectPOSIXRecord(err, ENOTDIR, "_IterateDirectory for " + dir + "/file returned Not a directory", kList);
 
-TEST(ListingAndRemoval, ExistsDanglingMissingAndUnsearchable) {
-  TempDir tmp;
-  sl::test::makeSymlink(tmp / "nowhere", tmp / "dangling");
-  sl::test::makeDirs(tmp / "locked/child", 0700);  // root's: nobody cannot search it
-  LogCapture log;
-
+  // A dangling link exists. Undeterminable (an unsearchable parent): both
+  // tests answer no, each with one line.
   EXPECT_TRUE(fm().itemExistsAtURL(fileURL(tmp / "dangling")));
   EXPECT_FALSE(fm().itemDoesNotExistAtURL(fileURL(tmp / "dangling")));
   EXPECT_FALSE(fm().itemExistsAtURL(fileURL(tmp / "missing")));
   EXPECT_TRUE(fm().itemDoesNotExistAtURL(fileURL(tmp / "missing")));
   EXPECT_EQ(log.installer(), Lines{});
-
-  // Undeterminable: both answer no, each with one line.
-  const sl::URL hidden = fileURL(tmp / "locked/child");
   {
     ScopedUnprivileged nobody;
-    EXPECT_FALSE(fm().itemExistsAtURL(hidden));
-    EXPECT_FALSE(fm().itemDoesNotExistAtURL(hidden));
+    EXPECT_FALSE(fm().itemExistsAtURL(fileURL(tmp / "locked/child")));
+    EXPECT_FALSE(fm().itemDoesNotExistAtURL(fileURL(tmp / "locked/child")));
   }
   const std::string message = "Failed to determine if file://" + tmp / "locked/child" + " exists: Permission denied";
-  EXPECT_EQ(log.installer(), (Lines{line(3, kExists, message), line(3, kDoesNotExist, message)}));
-}
-
-TEST(ListingAndRemoval, DefaultManagerSameInstanceFromEveryThread) {
-  std::vector<SLFileManager*> seen(8);
-  std::vector<std::thread> threads;
-  for (size_t i = 0; i < seen.size(); ++i)
-    threads.emplace_back([&seen, i] { seen[i] = &SLFileManager::defaultManager(); });
-  for (std::thread& t : threads) t.join();
-  for (SLFileManager* m : seen) EXPECT_EQ(m, &SLFileManager::defaultManager());
+  EXPECT_EQ(log.installer(), (Lines{installerLine(3, "-[SLFileManager itemExistsAtURL:]", message),
+                                    installerLine(3, "-[SLFileManager itemDoesNotExistAtURL:]", message)}));
 }
 
 }  // namespace

@@ -2,17 +2,12 @@
 #include <linux/fs.h>
 #include <sys/ioctl.h>
 #include <sys/mount.h>
-#include <sys/stat.h>
 #include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
-#include <functional>
-#include <string>
-#include <utility>
-#include <vector>
 
 #include <gtest/gtest.h>
 
@@ -31,20 +26,13 @@ class SLFileManagerTestAccess {
 
 namespace {
 
-using sl::test::LogCapture;
-using sl::test::TempDir;
+using namespace sl::test;
 using Lines = std::vector<LogCapture::Line>;
 
-constexpr char kTraverse[] = "-[SLFileManager _traverseDirectory:error:withBlock:]";
 constexpr char kStandardize[] = "-[SLFileManager standardizeOwnershipAtURL:toUID:GID:validateSymlinks:error:]";
-constexpr char kCheck[] = "-[SLFileManager realPathForURL:ifChildOfURL:]";
-constexpr uid_t kNobody = 65534;
+constexpr uid_t kNobody = ScopedUnprivileged::kUid;
 
 SLFileManager& fm() { return SLFileManager::defaultManager(); }
-sl::URL dirURL(const std::string& path) { return sl::URL::fileURLWithPath(path, true); }
-LogCapture::Line line(int level, const char* function, const std::string& message) {
-  return {level, "installer", function, message};
-}
 struct stat lstatOf(const std::string& path) {
   struct stat st {};
   EXPECT_EQ(lstat(path.c_str(), &st), 0) << path << ": " << strerror(errno);
@@ -69,14 +57,14 @@ TEST(TraversalAndOwnership, TraversalStopsAndMissingRoot) {
   // A stop without a record leaves the slot as the caller set it.
   const sl::Error sentinel("Sentinel", 1);
   sl::Error err = sentinel;
-  EXPECT_FALSE(SLFileManagerTestAccess::traverse(dirURL(tmp.path()), &err, [](FTSENT*, sl::Error*) { return false; }));
+  EXPECT_FALSE(
+      SLFileManagerTestAccess::traverse(fileURL(tmp.path(), true), &err, [](FTSENT*, sl::Error*) { return false; }));
   EXPECT_EQ(err, sentinel);
 
   LogCapture log;
-  EXPECT_FALSE(fm().standardizeOwnershipAtURL(dirURL(tmp / "absent"), 0, 0, true, &err));
-  EXPECT_EQ(err, sl::Error(sl::kPOSIXErrorDomain, ENOENT, err.userInfo()));
-  EXPECT_EQ(err.localizedDescription().str(), "Error for path " + tmp / "absent" + ": No such file or directory");
-  EXPECT_EQ(err.userInfo().get(SLFunctionNameErrorKey).asString().str(), kTraverse);
+  EXPECT_FALSE(fm().standardizeOwnershipAtURL(fileURL(tmp / "absent", true), 0, 0, true, &err));
+  expectPOSIXRecord(err, ENOENT, "Error for path " + tmp / "absent" + ": No such file or directory",
+                    "-[SLFileManager _traverseDirectory:error:withBlock:]");
   EXPECT_EQ(log.installer(), Lines{});
 }
 
@@ -85,89 +73,76 @@ TEST(TraversalAndOwnership, TraversalStopsAndMissingRoot) {
 TEST(TraversalAndOwnership, StandardTreeIsNotTouched) {
   TempDir tmp;
   const std::string root = tmp / "root";
-  sl::test::writeFile(root + "/d/f");
-  sl::test::writeFile(root + "/d/wrong", "", 0600);  // the control: it must change
-  sl::test::makeSymlink("f", root + "/d/inside");
+  writeFile(root + "/d/f");
+  writeFile(root + "/d/wrong", "", 0600);  // the control: it must change
+  makeSymlink("f", root + "/d/inside");
   for (const std::string& dir : {root, root + "/d"}) setMode(dir, 0755);
   const std::vector<std::string> standard = {root, root + "/d", root + "/d/f", root + "/d/inside"};
-
-  auto key = [](const timespec& t) { return std::pair(t.tv_sec, t.tv_nsec); };
-  std::vector<timespec> before;
-  for (const std::string& path : standard) before.push_back(lstatOf(path).st_ctim);
+  auto ctimeOf = [](const std::string& path) {
+    const timespec t = lstatOf(path).st_ctim;
+    return std::pair(t.tv_sec, t.tv_nsec);
+  };
+  std::vector<std::pair<time_t, long>> before;
+  for (const std::string& path : standard) before.push_back(ctimeOf(path));
   // Let the clock that stamps ctimes move past the newest one, so that a
   // change now would show.
-  const timespec newest = *std::max_element(before.begin(), before.end(),
-                                            [&](const timespec& a, const timespec& b) { return key(a) < key(b); });
-  for (timespec now{}; clock_gettime(CLOCK_REALTIME_COARSE, &now) == 0 && key(now) <= key(newest);) usleep(1000);
+  const auto newest = *std::max_element(before.begin(), before.end());
+  for (timespec now{}; clock_gettime(CLOCK_REALTIME_COARSE, &now) == 0 && std::pair(now.tv_sec, now.tv_nsec) <= newest;)
+    usleep(1000);
 
   LogCapture log;
   sl::Error err;
-  EXPECT_TRUE(fm().standardizeOwnershipAtURL(dirURL(root), 0, 0, true, &err)) << err.description();
-  for (size_t i = 0; i < standard.size(); ++i) {
-    SCOPED_TRACE(standard[i]);
-    EXPECT_EQ(key(lstatOf(standard[i]).st_ctim), key(before[i]));
-  }
+  EXPECT_TRUE(fm().standardizeOwnershipAtURL(fileURL(root, true), 0, 0, true, &err)) << err.description();
+  for (size_t i = 0; i < standard.size(); ++i) EXPECT_EQ(ctimeOf(standard[i]), before[i]) << standard[i];
   EXPECT_EQ(ownerAndMode(root + "/d/wrong"), "0:0 644");
   EXPECT_EQ(log.installer(), Lines{});
 }
 
-TEST(TraversalAndOwnership, OwnersModesAndUnvalidatedLinks) {
+// validateSymlinks off: links leading out are given the owner like any other
+// entry (they have no mode), and their targets are not touched. On: the first
+// such link stops the walk.
+TEST(TraversalAndOwnership, OwnersModesAndLinksLeadingOut) {
   TempDir tmp;
   const std::string root = tmp / "root";
-  sl::test::writeFile(tmp / "outside", "", 0600);
-  sl::test::writeFile(root + "/exec", "", 0755);
-  sl::test::writeFile(root + "/setuid", "", 04644);
-  sl::test::writeFile(root + "/groupOnly");
+  writeFile(tmp / "outside", "", 0600);
+  writeFile(root + "/exec", "", 0755);
+  writeFile(root + "/setuid", "", 04644);
+  writeFile(root + "/groupOnly");
   ASSERT_EQ(chown((root + "/groupOnly").c_str(), kNobody, 0), 0);
-  sl::test::makeDirs(root + "/closed");
+  makeDirs(root + "/closed");
   setMode(root + "/closed", 0700);
-  sl::test::makeSymlink(tmp / "outside", root + "/absolute");
-  sl::test::makeSymlink("../outside", root + "/climbs");
-  LogCapture log;
-  sl::Error err;
-
-  EXPECT_TRUE(fm().standardizeOwnershipAtURL(dirURL(root), kNobody, kNobody, false, &err)) << err.description();
-  for (const char* name : {"/exec", "/setuid", "/groupOnly"}) EXPECT_EQ(ownerAndMode(root + name), "65534:65534 644");
-  EXPECT_EQ(ownerAndMode(root + "/closed"), "65534:65534 755");
-  // The links themselves get the owner (they have no mode); their target
-  // outside the tree is not touched.
-  for (const char* name : {"/absolute", "/climbs"}) EXPECT_EQ(ownerAndMode(root + name), "65534:65534 777");
-  EXPECT_EQ(ownerAndMode(tmp / "outside"), "0:0 600");
-  EXPECT_EQ(log.installer(), Lines{});
-}
-
-TEST(TraversalAndOwnership, ValidatedLinksLeadingOutStopTheWalk) {
-  TempDir tmp;
-  sl::test::writeFile(tmp / "outside");
-  const std::string root = tmp / "root";
-  struct Case {
+  struct Link {
     const char* name;
-    std::string content;
-    std::string rejection;
-  } cases[] = {
+    std::string content, rejection;
+  } links[] = {
       {"absolute", tmp / "outside",
        "Rejecting " + root + "/absolute -> " + tmp / "outside" + ", as absolute symlinks are not allowed"},
       {"climbs", "../outside",
        "Rejecting " + root + "/climbs -> /../outside, as it is points outside or to the base " + root},
   };
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.name);
-    sl::test::forceRemove(root);
-    sl::test::makeDirs(root);
-    sl::test::makeSymlink(c.content, root + "/" + c.name);
-    LogCapture log;
-    sl::Error err;
-    EXPECT_FALSE(fm().standardizeOwnershipAtURL(dirURL(root), 0, 0, true, &err));
-    ASSERT_FALSE(err.isNull());
-    EXPECT_EQ(err.domain(), SLInstallerErrorDomain);
-    EXPECT_EQ(err.code(), 70);
+  for (const Link& link : links) makeSymlink(link.content, root + "/" + link.name);
+  LogCapture log;
+  sl::Error err;
+
+  EXPECT_TRUE(fm().standardizeOwnershipAtURL(fileURL(root, true), kNobody, kNobody, false, &err)) << err.description();
+  for (const char* name : {"/exec", "/setuid", "/groupOnly"}) EXPECT_EQ(ownerAndMode(root + name), "65534:65534 644");
+  EXPECT_EQ(ownerAndMode(root + "/closed"), "65534:65534 755");
+  for (const char* name : {"/absolute", "/climbs"}) EXPECT_EQ(ownerAndMode(root + name), "65534:65534 777");
+  EXPECT_EQ(ownerAndMode(tmp / "outside"), "0:0 600");
+  EXPECT_EQ(log.installer(), Lines{});
+
+  for (const Link& link : links) {
+    SCOPED_TRACE(link.name);
+    for (const Link& other : links) forceRemove(root + "/" + other.name);
+    makeSymlink(link.content, root + "/" + link.name);
+    log.clear();
+    EXPECT_FALSE(fm().standardizeOwnershipAtURL(fileURL(root, true), 0, 0, true, &err));
+    const std::string message = "invalid symlink at " + root + "/" + link.name;
+    expectRecord(err, SLInstallerErrorDomain, 70, message, kStandardize);
     EXPECT_EQ(err.userInfo().get("LegacyErrorString"), sl::Number(70));
-    EXPECT_EQ(err.userInfo().get(SLFunctionNameErrorKey).asString().str(), kStandardize);
-    const std::string message = "invalid symlink at " + root + "/" + c.name;
-    EXPECT_EQ(err.localizedDescription().str(), message);
-    const int64_t site = err.userInfo().get(SLSourceFileLineErrorKey).asNumber().int64Value();
-    EXPECT_EQ(log.installer(), (Lines{line(3, kCheck, c.rejection),
-                                      line(3, kStandardize, std::to_string(site) + ": " + message)}));
+    const std::string site = err.userInfo().get(SLSourceFileLineErrorKey).description();
+    EXPECT_EQ(log.installer(), (Lines{installerLine(3, "-[SLFileManager realPathForURL:ifChildOfURL:]", link.rejection),
+                                      installerLine(3, kStandardize, site + ": " + message)}));
   }
 }
 
@@ -175,10 +150,9 @@ TEST(TraversalAndOwnership, ValidatedLinksLeadingOutStopTheWalk) {
 // a disk file system (tmpfs does not take the attribute).
 TEST(TraversalAndOwnership, FailedChangeDoesNotStopTheWalk) {
   TempDir tmp("/tmp");
-  const std::string root = tmp / "root";
-  const std::string locked = root + "/locked";
-  sl::test::writeFile(locked, "", 0755);
-  sl::test::writeFile(root + "/sub/other", "", 0755);
+  const std::string root = tmp / "root", locked = root + "/locked";
+  writeFile(locked, "", 0755);
+  writeFile(root + "/sub/other", "", 0755);
   sl::UniqueFd fd(open(locked.c_str(), O_RDONLY | O_CLOEXEC));
   ASSERT_TRUE(fd);
   int flags = 0;
@@ -192,11 +166,12 @@ TEST(TraversalAndOwnership, FailedChangeDoesNotStopTheWalk) {
   LogCapture log;
   sl::Error err;
 
-  EXPECT_TRUE(fm().standardizeOwnershipAtURL(dirURL(root), kNobody, kNobody, false, &err)) << err.description();
+  EXPECT_TRUE(fm().standardizeOwnershipAtURL(fileURL(root, true), kNobody, kNobody, false, &err)) << err.description();
   EXPECT_EQ(ownerAndMode(locked), "0:0 755");
   EXPECT_EQ(ownerAndMode(root + "/sub/other"), "65534:65534 644");
-  EXPECT_EQ(log.installer(), (Lines{line(3, kStandardize, "Could not chown " + locked + ": Operation not permitted"),
-                                    line(3, kStandardize, "Could not chmod " + locked + ": Operation not permitted")}));
+  EXPECT_EQ(log.installer(),
+            (Lines{installerLine(3, kStandardize, "Could not chown " + locked + ": Operation not permitted"),
+                   installerLine(3, kStandardize, "Could not chmod " + locked + ": Operation not permitted")}));
 }
 
 // The walk examines root/d, then d's only child, a dangling link; while the
@@ -206,16 +181,15 @@ TEST(TraversalAndOwnership, FailedChangeDoesNotStopTheWalk) {
 // link that now stands at its path.
 TEST(TraversalAndOwnership, SwappedItemIsNotChangedThroughALink) {
   TempDir tmp;
-  const std::string root = tmp / "root";
-  const std::string elsewhere = tmp / "elsewhere";
-  sl::test::makeDirs(elsewhere);
+  const std::string root = tmp / "root", elsewhere = tmp / "elsewhere";
+  makeDirs(elsewhere);
   setMode(elsewhere, 0700);
-  sl::test::makeSymlink("missing", root + "/d/dangling");
+  makeSymlink("missing", root + "/d/dangling");
   setMode(root + "/d", 0700);
   LogCapture log;
-  sl::LogSink previous;
+  sl::LogSink previous;  // assigned before the sink can run
   previous = sl::setInstallerLogSink([&](const sl::LogRecord& record) {
-    if (std::string_view(record.message).starts_with("Failed to realpath") && !sl::test::exists(root + "/d.moved")) {
+    if (std::string_view(record.message).starts_with("Failed to realpath") && !exists(root + "/d.moved")) {
       EXPECT_EQ(rename((root + "/d").c_str(), (root + "/d.moved").c_str()), 0);
       EXPECT_EQ(symlink(elsewhere.c_str(), (root + "/d").c_str()), 0);
     }
@@ -224,31 +198,30 @@ TEST(TraversalAndOwnership, SwappedItemIsNotChangedThroughALink) {
   ScopeExit restore{[&] { sl::setInstallerLogSink(previous); }};
   sl::Error err;
 
-  EXPECT_TRUE(fm().standardizeOwnershipAtURL(dirURL(root), kNobody, kNobody, true, &err)) << err.description();
+  EXPECT_TRUE(fm().standardizeOwnershipAtURL(fileURL(root, true), kNobody, kNobody, true, &err)) << err.description();
   EXPECT_EQ(ownerAndMode(root + "/d.moved"), "65534:65534 755");  // changed on its first arrival
   EXPECT_EQ(ownerAndMode(root + "/d"), "0:0 777");
   EXPECT_EQ(ownerAndMode(elsewhere), "0:0 700");
   const Lines& lines = log.installer();
   ASSERT_EQ(lines.size(), 3u);
   EXPECT_TRUE(lines[0].message.starts_with("Failed to realpath " + root + "/d/dangling"));
-  EXPECT_EQ(lines[1], line(3, kStandardize, "Could not chown " + root + "/d: Stale file handle"));
-  EXPECT_EQ(lines[2], line(3, kStandardize, "Could not chmod " + root + "/d: Stale file handle"));
+  EXPECT_EQ(lines[1], installerLine(3, kStandardize, "Could not chown " + root + "/d: Stale file handle"));
+  EXPECT_EQ(lines[2], installerLine(3, kStandardize, "Could not chmod " + root + "/d: Stale file handle"));
 }
 
 TEST(TraversalAndOwnership, MountedVolumeIsNotEntered) {
   TempDir tmp;
-  const std::string root = tmp / "root";
-  const std::string mountPoint = root + "/mnt";
-  sl::test::makeDirs(mountPoint);
-  sl::test::writeFile(root + "/outer", "", 0600);
+  const std::string root = tmp / "root", mountPoint = root + "/mnt";
+  makeDirs(mountPoint);
+  writeFile(root + "/outer", "", 0600);
   if (mount("tmpfs", mountPoint.c_str(), "tmpfs", 0, "size=1m") != 0) {
     GTEST_SKIP() << "cannot mount a tmpfs: " << strerror(errno);
   }
   ScopeExit unmount{[&] { umount2(mountPoint.c_str(), MNT_DETACH); }};
-  sl::test::writeFile(mountPoint + "/inner", "", 0600);
+  writeFile(mountPoint + "/inner", "", 0600);
   sl::Error err;
 
-  EXPECT_TRUE(fm().standardizeOwnershipAtURL(dirURL(root), kNobody, kNobody, false, &err)) << err.description();
+  EXPECT_TRUE(fm().standardizeOwnershipAtURL(fileURL(root, true), kNobody, kNobody, false, &err)) << err.description();
   EXPECT_EQ(ownerAndMode(root + "/outer"), "65534:65534 644");
   // The mount point itself is an entry of the walk; what it holds is not.
   EXPECT_EQ(ownerAndMode(mountPoint), "65534:65534 755");

@@ -13,6 +13,7 @@
 #include <cstring>
 #include <filesystem>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "Platform/Removefile.h"
@@ -26,20 +27,13 @@ extern bool copyfile_test_buffered_data;
 
 namespace {
 
-using sl::test::exists;
-using sl::test::makeDirs;
-using sl::test::makeSymlink;
-using sl::test::readFile;
+using sl::test::exists, sl::test::makeDirs, sl::test::makeSymlink, sl::test::readFile, sl::test::writeFile;
 using sl::test::TempDir;
-using sl::test::writeFile;
+using Names = std::vector<std::string>;
 
 constexpr sl::copyfile_flags_t kFlags =
     sl::COPYFILE_ALL | sl::COPYFILE_RECURSIVE | sl::COPYFILE_NOFOLLOW_SRC | sl::COPYFILE_NOFOLLOW_DST;
 static_assert(kFlags == 0xC800F);
-
-// A TempDir that could not be made has the empty path, and every path
-// built on it would land in "/".
-bool made(const TempDir& dir) { return !dir.path().empty(); }
 
 // copyfile's errno, or 0 when it succeeded.
 int copy(const std::string& from, const std::string& to, sl::copyfile_flags_t flags = kFlags) {
@@ -54,22 +48,21 @@ struct stat lstatOf(const std::string& path) {
 }
 
 std::string linkTarget(const std::string& path) {
-  char buffer[4096];
-  ssize_t n = readlink(path.c_str(), buffer, sizeof buffer);
-  return n < 0 ? "" : std::string(buffer, static_cast<size_t>(n));
+  std::error_code ec;  // empty for anything but a link
+  return std::filesystem::read_symlink(path, ec);
 }
 
-std::vector<std::string> names(const std::string& dir) {
-  std::vector<std::string> out;
+Names names(const std::string& dir) {
+  Names out;
   for (const auto& entry : std::filesystem::directory_iterator(dir)) out.push_back(entry.path().filename());
   std::sort(out.begin(), out.end());
   return out;
 }
 
-// name=value of each extended attribute, the item itself (never a link's
+// name=value of each extended attribute of the item itself (never a link's
 // target).
-std::vector<std::string> attributes(const std::string& path) {
-  std::vector<std::string> out;
+Names attributes(const std::string& path) {
+  Names out;
   char list[4096];
   ssize_t n = llistxattr(path.c_str(), list, sizeof list);
   for (ssize_t i = 0; i < n; i += static_cast<ssize_t>(strlen(list + i)) + 1) {
@@ -89,11 +82,6 @@ void setAttribute(const std::string& path, const char* name, const std::string& 
 // little-endian): owner rwx, user 1234 r-x, group r-x, mask r-x, other none.
 const std::string kAcl("\2\0\0\0" "\1\0\7\0\xff\xff\xff\xff" "\2\0\5\0\xd2\4\0\0" "\4\0\5\0\xff\xff\xff\xff"
                        "\x10\0\5\0\xff\xff\xff\xff" "\x20\0\0\0\xff\xff\xff\xff", 44);
-
-void setTimes(const std::string& path, time_t seconds) {
-  const timespec times[2] = {{seconds, 123456789}, {seconds + 1, 123456790}};
-  ASSERT_EQ(utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW), 0) << path;
-}
 
 // A tree with every kind the copy knows except devices, and metadata that a
 // careless copy loses.
@@ -120,28 +108,30 @@ void buildTree(const std::string& root) {
   ASSERT_EQ(chown((root + "/setuid").c_str(), 1234, 5678), 0);
   ASSERT_EQ(chmod((root + "/setuid").c_str(), 06755), 0);  // after chown, which clears it
   writeFile(root + "/closed/inner", "i");
-  for (const char* item : {"data", "rel", "fifo", "d1/d2", "d1", "closed/inner"}) setTimes(root + "/" + item, 1000);
+  for (const char* item : {"data", "rel", "fifo", "d1/d2", "d1", "closed/inner", ""}) {
+    const time_t seconds = *item ? 1000 : 2000;
+    const timespec times[2] = {{seconds, 123456789}, {seconds + 1, 123456790}};
+    ASSERT_EQ(utimensat(AT_FDCWD, (root + "/" + item).c_str(), times, AT_SYMLINK_NOFOLLOW), 0) << item;
+  }
   chmod((root + "/closed").c_str(), 0);
-  setTimes(root, 2000);
 }
 
-// b is an exact copy of a: kinds, modes, owners, modification times,
+// b is an exact copy of a: kinds, modes, owners, devices, modification times,
 // contents, link targets and attributes, all the way down.
 void expectSameTree(const std::string& a, const std::string& b) {
   SCOPED_TRACE(b);
   struct stat sa = lstatOf(a), sb = lstatOf(b);
-  EXPECT_EQ(sa.st_mode, sb.st_mode);
-  EXPECT_EQ(sa.st_uid, sb.st_uid);
-  EXPECT_EQ(sa.st_gid, sb.st_gid);
-  EXPECT_EQ(sa.st_mtim.tv_sec, sb.st_mtim.tv_sec);
-  EXPECT_EQ(sa.st_mtim.tv_nsec, sb.st_mtim.tv_nsec);
+  auto metadata = [](const struct stat& s) {
+    return std::tuple(s.st_mode, s.st_uid, s.st_gid, s.st_rdev, s.st_mtim.tv_sec, s.st_mtim.tv_nsec);
+  };
+  EXPECT_EQ(metadata(sa), metadata(sb)) << "mode, uid, gid, rdev, mtime";
   EXPECT_EQ(attributes(a), attributes(b));
   if (!S_ISDIR(sa.st_mode)) {
     EXPECT_EQ(sa.st_size, sb.st_size);
     EXPECT_EQ(linkTarget(a), linkTarget(b));
     EXPECT_TRUE(!S_ISREG(sa.st_mode) || readFile(a) == readFile(b)) << "contents differ";
+    return;
   }
-  if (!S_ISDIR(sa.st_mode)) return;
   EXPECT_EQ(names(a), names(b));
   for (const std::string& name : names(a)) expectSameTree(a + "/" + name, b + "/" + name);
 }
@@ -149,22 +139,17 @@ void expectSameTree(const std::string& a, const std::string& b) {
 TEST(Copyfile, TreeBetweenVolumesAndWithinOne) {
   // Data goes by copy_file_range within a volume, by sendfile between
   // volumes, and through a buffer where neither is taken.
-  const struct {
-    const char* from;
-    const char* to;
-    bool buffered;
-  } volumes[] = {{TempDir::kShm, nullptr, false}, {nullptr, TempDir::kShm, true}, {nullptr, nullptr, false}};
-  for (const auto& volume : volumes) {
-    TempDir src(volume.from), dst(volume.to);
-    ASSERT_TRUE(made(src) && made(dst));
+  const std::tuple<const char*, const char*, bool> volumes[] = {  // source parent, destination parent, buffered
+      {TempDir::kShm, nullptr, false}, {nullptr, TempDir::kShm, true}, {nullptr, nullptr, false}};
+  for (const auto& [from, to, buffered] : volumes) {
+    TempDir src(from), dst(to);
     buildTree(src / "tree");
-    sl::copyfile_test_buffered_data = volume.buffered;
+    sl::copyfile_test_buffered_data = buffered;
     int err = copy(src / "tree", dst / "copy");
     sl::copyfile_test_buffered_data = false;
     ASSERT_EQ(err, 0);
     struct stat data = lstatOf(dst / "copy/data");  // before any read of it
-    EXPECT_EQ(data.st_atim.tv_sec, 1000);
-    EXPECT_EQ(data.st_atim.tv_nsec, 123456789);
+    EXPECT_EQ(std::pair(data.st_atim.tv_sec, data.st_atim.tv_nsec), std::pair(time_t{1000}, 123456789L));
     EXPECT_LT(lstatOf(dst / "copy/sparse").st_blocks * 512, 1 << 20) << "holes filled in";
     expectSameTree(src / "tree", dst / "copy");
   }
@@ -172,35 +157,28 @@ TEST(Copyfile, TreeBetweenVolumesAndWithinOne) {
   // An attribute that the destination refuses fails the copy: ext4 keeps
   // values of at most a block (unless made with large attributes).
   TempDir shm(TempDir::kShm), disk;
-  ASSERT_TRUE(made(shm) && made(disk));
+  const std::string big(10000, 'v');
   writeFile(shm / "big");
   writeFile(disk / "probe");
-  setAttribute(shm / "big", "user.big", std::string(10000, 'v'));
-  if (setxattr((disk / "probe").c_str(), "user.big", std::string(10000, 'v').data(), 10000, 0) != 0) {
+  setAttribute(shm / "big", "user.big", big);
+  if (setxattr((disk / "probe").c_str(), "user.big", big.data(), big.size(), 0) != 0) {
     EXPECT_EQ(copy(shm / "big", disk / "big"), ENOSPC);
   }
 }
 
 TEST(Copyfile, DeviceNodesAndSockets) {
   TempDir tmp(TempDir::kShm);
-  ASSERT_TRUE(made(tmp));
   makeDirs(tmp / "src");
-  if (mknod((tmp / "src/char").c_str(), S_IFCHR | 0640, makedev(1, 3)) != 0 && errno == EPERM) {
+  if (mknod((tmp / "src/char").c_str(), S_IFCHR | 0640, makedev(1, 3)) != 0 && errno == EPERM)
     GTEST_SKIP() << "making device nodes needs CAP_MKNOD";
-  }
   ASSERT_EQ(mknod((tmp / "src/block").c_str(), S_IFBLK | 0600, makedev(7, 200)), 0);
   ASSERT_EQ(mknod((tmp / "src/socket").c_str(), S_IFSOCK | 0755, 0), 0);
   ASSERT_EQ(copy(tmp / "src", tmp / "dst"), 0);
-  for (const char* name : {"char", "block", "socket"}) {
-    struct stat a = lstatOf(tmp / "src/" + name), b = lstatOf(tmp / "dst/" + name);
-    EXPECT_EQ(a.st_mode, b.st_mode) << name;
-    EXPECT_EQ(a.st_rdev, b.st_rdev) << name;
-  }
+  expectSameTree(tmp / "src", tmp / "dst");
 }
 
 TEST(Copyfile, LinksAtTheTopAndAtTheDestination) {
   TempDir tmp(TempDir::kShm);
-  ASSERT_TRUE(made(tmp));
   writeFile(tmp / "target/file", "t");
   makeSymlink("target", tmp / "link");
   // A link source is copied as the link; without NOFOLLOW_SRC it is followed.
@@ -216,18 +194,16 @@ TEST(Copyfile, LinksAtTheTopAndAtTheDestination) {
   EXPECT_EQ(copy(tmp / "followed", tmp / "dstLink"), ENOTDIR);
   EXPECT_EQ(copy(tmp / "src", tmp / "dstLink"), 0);
   EXPECT_EQ(readFile(tmp / "dstLink"), "new");
-  EXPECT_FALSE(S_ISLNK(lstatOf(tmp / "dstLink").st_mode));
-  EXPECT_EQ(names(tmp / "target"), std::vector<std::string>{"file"});
+  EXPECT_EQ(names(tmp / "target"), Names{"file"});
 
   // Without NOFOLLOW_DST a link to a directory stands for the directory.
   writeFile(tmp / "more/added");
   ASSERT_EQ(copy(tmp / "more", tmp / "link", kFlags & ~sl::COPYFILE_NOFOLLOW_DST), 0);
-  EXPECT_EQ(names(tmp / "target"), (std::vector<std::string>{"added", "file"}));
+  EXPECT_EQ(names(tmp / "target"), (Names{"added", "file"}));
 }
 
 TEST(Copyfile, MergeReplaceAndConflicts) {
   TempDir tmp(TempDir::kShm);
-  ASSERT_TRUE(made(tmp));
   writeFile(tmp / "src/file", "new");
   writeFile(tmp / "src/sub/new");
   makeSymlink("x", tmp / "src/link");
@@ -236,37 +212,31 @@ TEST(Copyfile, MergeReplaceAndConflicts) {
   writeFile(tmp / "dst/sub/old");
   writeFile(tmp / "dst/link", "a file until now");
   ASSERT_EQ(copy(tmp / "src", tmp / "dst"), 0);
-  EXPECT_EQ(names(tmp / "dst"), (std::vector<std::string>{"file", "keep", "link", "sub"}));  // no temporaries
-  EXPECT_EQ(names(tmp / "dst/sub"), (std::vector<std::string>{"new", "old"}));
+  EXPECT_EQ(names(tmp / "dst"), (Names{"file", "keep", "link", "sub"}));  // no temporaries
+  EXPECT_EQ(names(tmp / "dst/sub"), (Names{"new", "old"}));
   EXPECT_EQ(readFile(tmp / "dst/file"), "new");
   EXPECT_EQ(linkTarget(tmp / "dst/link"), "x");
 
   writeFile(tmp / "other/sub", "a file where dst has a directory");
-  const struct {
-    const char* from;
-    const char* to;
-    int err;
-  } rows[] = {{"src/file", "dst/sub", EISDIR},  {"other", "dst", EISDIR},
-              {"src/sub", "dst/keep", ENOTDIR}, {"src/file/", "x", ENOTDIR},
-              {"missing", "x", ENOENT},         {"src/file", "missing/x", ENOENT},
-              {"src/file", "src/file", 0}};
+  const std::tuple<const char*, const char*, int> rows[] = {
+      {"src/file", "dst/sub", EISDIR}, {"other", "dst", EISDIR},   {"src/sub", "dst/keep", ENOTDIR},
+      {"src/file/", "x", ENOTDIR},     {"missing", "x", ENOENT},   {"src/file", "missing/x", ENOENT},
+      {"src/file", "src/file", 0}};
   const ino_t inode = lstatOf(tmp / "src/file").st_ino;
-  for (const auto& row : rows) EXPECT_EQ(copy(tmp / row.from, tmp / row.to), row.err) << row.from << " " << row.to;
+  for (const auto& [from, to, err] : rows) EXPECT_EQ(copy(tmp / from, tmp / to), err) << from << " " << to;
   EXPECT_EQ(lstatOf(tmp / "src/file").st_ino, inode) << "copied onto itself";
 
   // An ACL that the destination directory would hand down is not added.
   makeDirs(tmp / "inheriting");
   setAttribute(tmp / "inheriting", "system.posix_acl_default", kAcl);
   ASSERT_EQ(copy(tmp / "src", tmp / "inheriting/copy"), 0);
-  EXPECT_EQ(attributes(tmp / "inheriting/copy"), std::vector<std::string>{});
-  EXPECT_EQ(attributes(tmp / "inheriting/copy/file"), std::vector<std::string>{});
   ASSERT_EQ(copy(tmp / "src/file", tmp / "inheriting/file"), 0);
-  EXPECT_EQ(attributes(tmp / "inheriting/file"), std::vector<std::string>{});
+  for (const char* item : {"inheriting/copy", "inheriting/copy/file", "inheriting/file"})
+    EXPECT_EQ(attributes(tmp / item), Names{}) << item;
 }
 
 TEST(Copyfile, UnprivilegedCaller) {
   TempDir src(TempDir::kShm), dst(TempDir::kShm);
-  ASSERT_TRUE(made(src) && made(dst));
   ASSERT_EQ(chmod(dst.path().c_str(), 0777), 0);
   writeFile(src / "ok/setid", "x", 06755);
   writeFile(src / "tree/a", "a");
@@ -276,8 +246,7 @@ TEST(Copyfile, UnprivilegedCaller) {
   // set-id bits.
   ASSERT_EQ(copy(src / "ok", dst / "ok"), 0);
   struct stat st = lstatOf(dst / "ok/setid");
-  EXPECT_EQ(st.st_mode & 07777, 0755u);
-  EXPECT_EQ(st.st_uid, sl::test::ScopedUnprivileged::kUid);
+  EXPECT_EQ(std::pair(st.st_mode & 07777, st.st_uid), std::pair(0755u, sl::test::ScopedUnprivileged::kUid));
   // A file that cannot be read fails the copy; what was made stays.
   EXPECT_EQ(copy(src / "tree", dst / "tree"), EACCES);
   EXPECT_TRUE(exists(dst / "tree"));
@@ -285,7 +254,6 @@ TEST(Copyfile, UnprivilegedCaller) {
 
 TEST(Copyfile, IntoItselfAndVeryDeep) {
   TempDir tmp(TempDir::kShm);
-  ASSERT_TRUE(made(tmp));
   // The trees here may be too deep for TempDir's own cleanup.
   struct RemoveDeep {
     const TempDir& tmp;
@@ -312,17 +280,15 @@ TEST(Copyfile, IntoItselfAndVeryDeep) {
 
   // Far deeper than the descriptor budget and than PATH_MAX.
   constexpr int kDepth = 10000;
-  {
-    sl::UniqueFd fd(open(tmp.path().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-    for (int i = 0; i < kDepth && fd; ++i) {
-      ASSERT_EQ(mkdirat(fd.get(), i == 0 ? "deep" : "d", 0755), 0);
-      fd = sl::UniqueFd(openat(fd.get(), i == 0 ? "deep" : "d", O_PATH | O_DIRECTORY | O_CLOEXEC));
-    }
-    ASSERT_TRUE(fd);
-    sl::UniqueFd file(openat(fd.get(), "bottom", O_WRONLY | O_CREAT | O_CLOEXEC, 0644));
+  sl::UniqueFd fd(open(tmp.path().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  for (int i = 0; i < kDepth && fd; ++i) {
+    ASSERT_EQ(mkdirat(fd.get(), i == 0 ? "deep" : "d", 0755), 0);
+    fd = sl::UniqueFd(openat(fd.get(), i == 0 ? "deep" : "d", O_PATH | O_DIRECTORY | O_CLOEXEC));
   }
+  ASSERT_TRUE(fd);
+  ASSERT_TRUE(sl::UniqueFd(openat(fd.get(), "bottom", O_WRONLY | O_CREAT | O_CLOEXEC, 0644)));
   EXPECT_EQ(copy(tmp / "deep", tmp / "deepCopy"), 0);
-  sl::UniqueFd fd(open((tmp / "deepCopy").c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  fd = sl::UniqueFd(open((tmp / "deepCopy").c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
   for (int i = 1; i < kDepth && fd; ++i) fd = sl::UniqueFd(openat(fd.get(), "d", O_PATH | O_DIRECTORY | O_CLOEXEC));
   ASSERT_TRUE(fd);
   struct stat st;

@@ -15,9 +15,7 @@ using sl::test::writeFile;
 
 // Points the registry at a made-up tree and mount table for the scope.
 struct ScopedLocations {
-  ScopedLocations(const std::string& sysfs, const std::string& mountInfo) {
-    sl::setDeviceRegistryLocations(sysfs, mountInfo);
-  }
+  explicit ScopedLocations(const std::string& dir) { sl::setDeviceRegistryLocations(dir + "/sys", dir + "/mountinfo"); }
   ~ScopedLocations() { sl::setDeviceRegistryLocations("/sys", "/proc/self/mountinfo"); }
 };
 
@@ -42,7 +40,7 @@ TEST(DeviceRegistryTest, LoopDevicesAreControllerDrivesAndMedia) {
   const std::string block = tmp / "sys/block";
   makeDirs(block + "/vda");
   makeDirs(block + "/loopback");  // not a loop device
-  ScopedLocations locations(tmp / "sys", tmp / "mountinfo");
+  ScopedLocations locations(tmp.path());
   const size_t handlesBefore = sl::dvOutstandingHandles();
 
   EXPECT_EQ(sl::dvServiceGetMatchingService("DVQVAMController"), 0u);  // no loop device yet

@@ -45,16 +45,14 @@ TEST(Preferences, PendingChangesSynchroniseAtomicallyOrStayPending) {
   sl::preferencesSetValue("Flag", sl::Boolean(true), kDomain);
   sl::Error error;
   EXPECT_FALSE(sl::preferencesSynchronize(kDomain, &error));
-  EXPECT_TRUE(error.isPOSIX(ENOTDIR));
-  EXPECT_EQ(error.localizedDescription().str(), "mkpath_np of " + dir + " failed: Not a directory");
+  sl::test::expectPOSIXRecord(error, ENOTDIR, "mkpath_np of " + dir + " failed: Not a directory", nullptr);
   EXPECT_EQ(sl::preferencesCopyValue("Flag", kDomain), sl::Boolean(true));
 
   // The next synchronise makes the directory (0755) and writes the change.
   sl::test::forceRemove(dir);
   ASSERT_TRUE(sl::preferencesSynchronize(kDomain));
   struct stat st{};
-  ASSERT_EQ(stat(dir.c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 07777, 0755u);
+  EXPECT_TRUE(stat(dir.c_str(), &st) == 0 && (st.st_mode & 07777) == 0755) << std::oct << st.st_mode;
   EXPECT_EQ(sl::dictionaryWithContentsOfURL(file), (sl::Dictionary{{"Flag", sl::Boolean(true)}}));
 }
 

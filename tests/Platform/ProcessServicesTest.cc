@@ -4,7 +4,9 @@
 #include <cerrno>
 #include <future>
 #include <stdexcept>
+#include <string>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "Platform/ProcessServices.h"
@@ -19,8 +21,7 @@ TEST(ProcessServicesTest, MonitorAddressesOnlyTheOwnProcess) {
 }
 
 TEST(ProcessServicesTest, TaskQueueRunsInOrderOnItsOwnNamedThreadAndDrains) {
-  std::vector<int> order;
-  std::vector<std::thread::id> threads;
+  std::vector<std::pair<int, std::thread::id>> ran;
   std::string workerName;
   std::promise<void> gate;
   {
@@ -31,18 +32,12 @@ TEST(ProcessServicesTest, TaskQueueRunsInOrderOnItsOwnNamedThreadAndDrains) {
       ready.wait();
       sl::currentThreadName(&workerName);
     });
-    for (int i = 0; i < 50; ++i) {
-      queue.async([&, i] {
-        order.push_back(i);
-        threads.push_back(std::this_thread::get_id());
-      });
-    }
+    for (int i = 0; i < 50; ++i) queue.async([&, i] { ran.emplace_back(i, std::this_thread::get_id()); });
     gate.set_value();
   }
-  ASSERT_EQ(order.size(), 50u);
-  for (int i = 0; i < 50; ++i) EXPECT_EQ(order[i], i);
-  for (const auto& id : threads) EXPECT_EQ(id, threads.front());
-  EXPECT_NE(threads.front(), std::this_thread::get_id());
+  ASSERT_EQ(ran.size(), 50u);
+  EXPECT_NE(ran[0].second, std::this_thread::get_id());
+  for (int i = 0; i < 50; ++i) EXPECT_EQ(ran[i], std::pair(i, ran[0].second));
   EXPECT_EQ(workerName, "com.vantor.stow");  // cut to 15 bytes
 }
 

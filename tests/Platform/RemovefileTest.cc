@@ -22,11 +22,7 @@ extern void (*removefile_test_hook_after_listing)(int dirFd, const char* path);
 
 namespace {
 
-using sl::test::exists;
-using sl::test::makeDirs;
-using sl::test::makeSymlink;
-using sl::test::readFile;
-using sl::test::writeFile;
+using sl::test::exists, sl::test::makeDirs, sl::test::makeSymlink, sl::test::readFile, sl::test::writeFile;
 using Reports = std::vector<std::pair<std::string, int>>;
 // removefile's result, errno when it failed (else 0), and the (path, errno)
 // pairs that the callback saw.
@@ -71,7 +67,7 @@ TEST(Removefile, TopLevelItemsAndLinks) {
   // A file, a link to a directory, and a tree of links to outside items:
   // all go, no link target is touched.
   writeFile(dir / "file");
-  makeDirs(dir / "target/kept");
+  writeFile(dir / "target/kept");
   writeFile(dir / "outside", "keep");
   makeSymlink(dir / "target", dir / "link");
   makeSymlink(dir / "outside", dir / "tree/a/to-file");
@@ -84,11 +80,11 @@ TEST(Removefile, TopLevelItemsAndLinks) {
   EXPECT_TRUE(exists(dir / "target/kept"));
   EXPECT_EQ(readFile(dir / "outside"), "keep");
   // Nothing there: ENOENT without a callback. A link named with a trailing
-  // slash is not followed to its directory.
-  EXPECT_EQ(removeWith(dir / "missing"), (Outcome{-1, ENOENT, {}}));
+  // slash is not followed to its directory. Not recursive: a non-empty
+  // directory stays, through the error path.
   makeSymlink(dir / "target", dir / "link");
+  EXPECT_EQ(removeWith(dir / "missing"), (Outcome{-1, ENOENT, {}}));
   EXPECT_EQ(removeWith(dir / "link/"), (Outcome{-1, ENOTDIR, {}}));
-  // Not recursive: a non-empty directory stays, through the error path.
   EXPECT_EQ(removeWith(dir / "target", kNoCallback, 0), (Outcome{-1, ENOTEMPTY, {}}));
   EXPECT_EQ(removeWith(dir / "target", sl::REMOVEFILE_PROCEED, 0), (Outcome{0, 0, {{dir / "target", ENOTEMPTY}}}));
   EXPECT_TRUE(exists(dir / "target/kept"));
@@ -101,17 +97,15 @@ TEST(Removefile, DeepTreeWithFewDescriptors) {
   for (int level = 0; level < 10000 && fd; ++level) {
     // Files beside some directories: the walk goes back down from parents
     // that it had to open again.
-    if (level % 100 == 0) {
-      ASSERT_TRUE(sl::UniqueFd(openat(fd.get(), "f", O_CREAT | O_WRONLY | O_CLOEXEC, 0644)));
-    }
+    ASSERT_TRUE(level % 100 != 0 || sl::UniqueFd(openat(fd.get(), "f", O_CREAT | O_WRONLY | O_CLOEXEC, 0644)));
     ASSERT_EQ(mkdirat(fd.get(), "d", 0755), 0);
     fd = sl::UniqueFd(openat(fd.get(), "d", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   }
   ASSERT_TRUE(fd);
   fd.reset();
-  rlimit saved, lowered;
+  rlimit saved;
   ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &saved), 0);
-  lowered = {64, saved.rlim_max};
+  const rlimit lowered = {64, saved.rlim_max};
   ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &lowered), 0);
   Outcome outcome = removeWith(dir / "deep", kNoCallback);
   ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &saved), 0);
@@ -122,19 +116,16 @@ TEST(Removefile, DeepTreeWithFewDescriptors) {
 TEST(Removefile, FailingEntriesAreReported) {
   sl::test::TempDir dir;
   ASSERT_EQ(chown(dir.path().c_str(), sl::test::ScopedUnprivileged::kUid, sl::test::ScopedUnprivileged::kGid), 0);
-  for (const std::string& top : {dir / "proceed", dir / "stop", dir / "none"}) {
-    sl::test::ScopedUnprivileged nobody;
-    makeDirs(top + "/a/locked");
-    writeFile(top + "/a/locked/f");
-    writeFile(top + "/a/file");
-    makeDirs(top + "/b/c");
-    makeDirs(top + "/empty-locked");
-    ASSERT_EQ(chmod((top + "/a/locked").c_str(), 0), 0);
-    ASSERT_EQ(chmod((top + "/empty-locked").c_str(), 0), 0);
-  }
   const std::string top = dir / "proceed";
   {
     sl::test::ScopedUnprivileged nobody;
+    for (const std::string& tree : {top, dir / "stop", dir / "none"}) {
+      writeFile(tree + "/a/locked/f");
+      writeFile(tree + "/a/file");
+      makeDirs(tree + "/b/c");
+      makeDirs(tree + "/empty-locked", 0);
+      ASSERT_EQ(chmod((tree + "/a/locked").c_str(), 0), 0);
+    }
     // Report and go on: the directory that cannot be opened, then each
     // parent that it keeps from being empty. An empty one that cannot be
     // opened goes.
@@ -144,9 +135,7 @@ TEST(Removefile, FailingEntriesAreReported) {
     EXPECT_EQ(removeWith(dir / "stop", sl::REMOVEFILE_STOP), (Outcome{-1, EACCES, {{dir / "stop/a/locked", EACCES}}}));
     EXPECT_EQ(removeWith(dir / "none", kNoCallback), (Outcome{-1, EACCES, {}}));
   }
-  EXPECT_FALSE(exists(top + "/a/file"));
-  EXPECT_FALSE(exists(top + "/b"));
-  EXPECT_FALSE(exists(top + "/empty-locked"));
+  for (const char* gone : {"/a/file", "/b", "/empty-locked"}) EXPECT_FALSE(exists(top + gone)) << gone;
   EXPECT_TRUE(exists(top + "/a/locked/f"));
 }
 

@@ -3,6 +3,7 @@
 #include <climits>
 #include <cstdlib>
 #include <string>
+#include <utility>
 
 #include <gtest/gtest.h>
 
@@ -16,13 +17,11 @@ TEST(SystemRoot, NormalisationPathsBelowAndEnvironment) {
   const std::string here = std::string(cwd) == "/" ? "" : cwd;
   const std::string& first = sl::systemRoot();
   const std::string firstCopy = first;
-  const struct {
-    const char* given;
-    std::string root;
-  } rows[] = {{"//", "/"}, {"/srv//./root//", "/srv/root"}, {"/srv/../root", "/srv/../root"}, {"rel/", here + "/rel"}};
-  for (const auto& row : rows) {
-    sl::setSystemRoot(row.given);
-    EXPECT_EQ(sl::systemRoot(), row.root) << row.given;
+  const std::pair<const char*, std::string> rows[] = {
+      {"//", "/"}, {"/srv//./root//", "/srv/root"}, {"/srv/../root", "/srv/../root"}, {"rel/", here + "/rel"}};
+  for (const auto& [given, root] : rows) {
+    sl::setSystemRoot(given);
+    EXPECT_EQ(sl::systemRoot(), root) << given;
   }
   EXPECT_EQ(first, firstCopy);  // references outlive a change of root
 
