@@ -1,0 +1,317 @@
+// The icon renderer on Linux: libpng for decoding, the scaling and the
+// shape done here.
+//
+// libpng reports errors by longjmp to the last setjmp. Every setjmp here
+// sits in a small function whose own locals are all trivial, and the
+// structures live in a guard owned by its caller, so a jump never skips a
+// destructor and never leaves a clobbered local behind: the caller sees
+// false and the guard frees the structures as it goes out of scope.
+
+#include "Platform/Icon.h"
+
+#include <fcntl.h>
+#include <png.h>
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cmath>
+#include <csetjmp>
+#include <cstring>
+#include <new>
+#include <string>
+#include <string_view>
+
+#include "Platform/Bundle.h"
+#include "Platform/UniqueFd.h"
+
+namespace sl {
+
+namespace {
+
+// ---- Decoding ----
+
+struct PngReadGuard {
+  png_structp png = nullptr;
+  png_infop info = nullptr;
+  PngReadGuard() = default;
+  PngReadGuard(const PngReadGuard&) = delete;
+  PngReadGuard& operator=(const PngReadGuard&) = delete;
+  ~PngReadGuard() {
+    if (png != nullptr) png_destroy_read_struct(&png, info != nullptr ? &info : nullptr, nullptr);
+  }
+};
+
+struct MemoryReader {
+  const uint8_t* bytes;
+  size_t size;
+  size_t offset;
+};
+
+// Errors end in a jump back to the setjmp of the phase that is running;
+// nothing is printed. Warnings are dropped.
+[[noreturn]] void silentError(png_structp png, png_const_charp) { png_longjmp(png, 1); }
+void silentWarning(png_structp, png_const_charp) {}
+
+void readFromMemory(png_structp png, png_bytep out, png_size_t length) {
+  auto* reader = static_cast<MemoryReader*>(png_get_io_ptr(png));
+  if (length > reader->size - reader->offset) png_error(png, "truncated");
+  std::memcpy(out, reader->bytes + reader->offset, length);
+  reader->offset += length;
+}
+
+// First phase: the header, and the transformations that turn every colour
+// type and depth into 8-bit RGBA. False on any libpng error.
+bool readHeader(png_structp png, png_infop info, png_uint_32* width, png_uint_32* height) {
+  if (setjmp(png_jmpbuf(png))) return false;
+  png_read_info(png, info);
+  png_set_expand(png);        // palette to RGB, low-depth grey to 8 bits, tRNS to alpha
+  png_set_strip_16(png);      // 16-bit samples to 8
+  png_set_gray_to_rgb(png);
+  png_set_add_alpha(png, 0xff, PNG_FILLER_AFTER);  // only where there is no alpha yet
+  (void)png_set_interlace_handling(png);
+  png_read_update_info(png, info);
+  if (png_get_bit_depth(png, info) != 8 || png_get_channels(png, info) != 4) return false;
+  *width = png_get_image_width(png, info);
+  *height = png_get_image_height(png, info);
+  return png_get_rowbytes(png, info) == size_t{*width} * 4;
+}
+
+// Second phase: the pixels, into rows prepared by the caller.
+bool readPixels(png_structp png, png_infop info, png_bytepp rows) {
+  if (setjmp(png_jmpbuf(png))) return false;
+  png_read_image(png, rows);
+  png_read_end(png, info);
+  return true;
+}
+
+// ---- Candidates ----
+
+bool isSingleComponent(std::string_view name) {
+  return !name.empty() && name != "." && name != ".." && name.find('/') == std::string_view::npos;
+}
+
+bool hasSuffix(std::string_view name, std::string_view suffix) {
+  return name.size() >= suffix.size() && name.substr(name.size() - suffix.size()) == suffix;
+}
+
+void addCandidate(std::vector<std::string>* candidates, std::string_view name) {
+  if (!isSingleComponent(name)) return;
+  auto add = [candidates](std::string entry) {
+    if (std::find(candidates->begin(), candidates->end(), entry) == candidates->end())
+      candidates->push_back(std::move(entry));
+  };
+  add(std::string(name));
+  if (!hasSuffix(name, ".png")) add(std::string(name) + ".png");
+}
+
+std::vector<std::string> namedCandidates(const URL& bundleURL) {
+  std::vector<std::string> candidates;
+  const std::shared_ptr<Bundle> bundle = Bundle::createUnique(bundleURL);
+  if (!bundle) return candidates;
+  const Dictionary info = bundle->infoDictionary();
+  for (const Value& name : info.get(kBundleIconFilesKey).asArray()) {
+    const String text = name.asString();
+    if (!text.isNull()) addCandidate(&candidates, text.view());
+  }
+  const String single = info.get(kBundleIconFileKey).asString();
+  if (!single.isNull()) addCandidate(&candidates, single.view());
+  return candidates;
+}
+
+// "Icon*.png" at the top of the bundle, sorted; empty when the directory
+// cannot be listed.
+std::vector<std::string> scannedCandidates(int bundleFd) {
+  std::vector<std::string> names;
+  UniqueFd listing(::openat(bundleFd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!listing) return names;
+  UniqueDir dir = fdopendir(listing);
+  if (!dir) return names;
+  for (;;) {
+    errno = 0;
+    const dirent* entry = ::readdir(dir.get());
+    if (entry == nullptr) break;  // end or error: either way, what was read is all there is
+    const std::string_view name(entry->d_name);
+    if (name.starts_with("Icon") && hasSuffix(name, ".png")) names.emplace_back(name);
+  }
+  std::sort(names.begin(), names.end());
+  return names;
+}
+
+// The bytes of a regular file in the bundle, never through a link; false
+// when it cannot be opened or read, is not regular or is too large.
+bool readCandidate(int bundleFd, const std::string& name, std::vector<uint8_t>* out) {
+  UniqueFd fd(::openat(bundleFd, name.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC | O_NONBLOCK));
+  if (!fd) return false;
+  struct stat st;
+  if (::fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode)) return false;
+  if (st.st_size <= 0 || static_cast<uint64_t>(st.st_size) > kMaxIconFileSize) return false;
+  std::vector<uint8_t> bytes(static_cast<size_t>(st.st_size));
+  size_t used = 0;
+  while (used < bytes.size()) {
+    ssize_t n = ::read(fd.get(), bytes.data() + used, bytes.size() - used);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) return false;  // an error, or the file shrank under us
+    used += static_cast<size_t>(n);
+  }
+  *out = std::move(bytes);
+  return true;
+}
+
+// ---- Scaling and shape ----
+
+// For one axis: the source pixels each destination pixel covers, with the
+// share of the destination pixel that each of them fills (the shares of
+// one destination pixel add up to 1).
+struct Tap {
+  uint32_t source;
+  double weight;
+};
+
+std::vector<std::vector<Tap>> areaTaps(uint32_t sourceSize, uint32_t destinationSize) {
+  std::vector<std::vector<Tap>> taps(destinationSize);
+  const double scale = static_cast<double>(sourceSize) / destinationSize;
+  for (uint32_t d = 0; d < destinationSize; ++d) {
+    const double begin = d * scale;
+    const double end = std::min<double>((d + 1) * scale, sourceSize);
+    for (auto s = static_cast<uint32_t>(begin); s < sourceSize && s < end; ++s) {
+      const double overlap = std::min<double>(end, s + 1.0) - std::max<double>(begin, s);
+      if (overlap > 0) taps[d].push_back({s, overlap / scale});
+    }
+  }
+  return taps;
+}
+
+// Scales to size x size in premultiplied alpha; the result is premultiplied
+// floats, 0 to 255 per channel.
+std::vector<float> scalePremultiplied(const Image& source, uint32_t size) {
+  const auto columns = areaTaps(source.width, size);
+  const auto rows = areaTaps(source.height, size);
+
+  // Horizontal pass: every source row to `size` premultiplied pixels.
+  std::vector<float> horizontal(size_t{size} * source.height * 4, 0.0f);
+  for (uint32_t y = 0; y < source.height; ++y) {
+    const uint8_t* in = source.pixels.data() + size_t{y} * source.width * 4;
+    float* out = horizontal.data() + size_t{y} * size * 4;
+    for (uint32_t x = 0; x < size; ++x) {
+      double sum[4] = {0, 0, 0, 0};
+      for (const Tap& tap : columns[x]) {
+        const uint8_t* p = in + size_t{tap.source} * 4;
+        const double alpha = p[3] * tap.weight;
+        sum[0] += p[0] * alpha / 255.0;
+        sum[1] += p[1] * alpha / 255.0;
+        sum[2] += p[2] * alpha / 255.0;
+        sum[3] += alpha;
+      }
+      for (int c = 0; c < 4; ++c) out[size_t{x} * 4 + c] = static_cast<float>(sum[c]);
+    }
+  }
+
+  // Vertical pass.
+  std::vector<float> result(size_t{size} * size * 4, 0.0f);
+  for (uint32_t y = 0; y < size; ++y) {
+    for (uint32_t x = 0; x < size; ++x) {
+      double sum[4] = {0, 0, 0, 0};
+      for (const Tap& tap : rows[y]) {
+        const float* p = horizontal.data() + (size_t{tap.source} * size + x) * 4;
+        for (int c = 0; c < 4; ++c) sum[c] += p[c] * tap.weight;
+      }
+      for (int c = 0; c < 4; ++c) result[(size_t{y} * size + x) * 4 + c] = static_cast<float>(sum[c]);
+    }
+  }
+  return result;
+}
+
+// Coverage of the pixel (x, y) by the rounded square of side `size`.
+double shapeCoverage(uint32_t x, uint32_t y, uint32_t size) {
+  const double radius = kHomeScreenIconCornerRadius * size;
+  // Distance of the pixel centre from the nearer edge, on each axis.
+  const double cx = std::min(x + 0.5, size - (x + 0.5));
+  const double cy = std::min(y + 0.5, size - (y + 0.5));
+  if (cx >= radius || cy >= radius) return 1.0;
+  const double distance = std::hypot(radius - cx, radius - cy);
+  return std::clamp(radius - distance + 0.5, 0.0, 1.0);
+}
+
+uint8_t toByte(double value) { return static_cast<uint8_t>(std::lround(std::clamp(value, 0.0, 255.0))); }
+
+Image shapeAndUnpremultiply(const std::vector<float>& premultiplied, uint32_t size) {
+  Image image;
+  image.width = size;
+  image.height = size;
+  image.pixels.assign(size_t{size} * size * 4, 0);
+  for (uint32_t y = 0; y < size; ++y) {
+    for (uint32_t x = 0; x < size; ++x) {
+      const size_t i = (size_t{y} * size + x) * 4;
+      const double alpha = premultiplied[i + 3] * shapeCoverage(x, y, size);
+      const uint8_t alphaByte = toByte(alpha);
+      if (alphaByte == 0) continue;  // transparent pixels keep colour 0
+      // Coverage scales colour and alpha alike, so the straight colour is
+      // the premultiplied one over the unshaped alpha.
+      const double unshaped = premultiplied[i + 3];
+      for (int c = 0; c < 3; ++c) image.pixels[i + c] = toByte(premultiplied[i + c] * 255.0 / unshaped);
+      image.pixels[i + 3] = alphaByte;
+    }
+  }
+  return image;
+}
+
+}  // namespace
+
+bool decodePNG(const std::vector<uint8_t>& bytes, Image* out) {
+  if (bytes.size() < 8 || png_sig_cmp(bytes.data(), 0, 8) != 0) return false;
+  PngReadGuard guard;
+  guard.png = png_create_read_struct(PNG_LIBPNG_VER_STRING, nullptr, silentError, silentWarning);
+  if (guard.png == nullptr) return false;
+  guard.info = png_create_info_struct(guard.png);
+  if (guard.info == nullptr) return false;
+  png_set_user_limits(guard.png, kMaxIconDimension, kMaxIconDimension);
+  MemoryReader reader{bytes.data(), bytes.size(), 0};
+  png_set_read_fn(guard.png, &reader, readFromMemory);
+
+  png_uint_32 width = 0;
+  png_uint_32 height = 0;
+  if (!readHeader(guard.png, guard.info, &width, &height) || width == 0 || height == 0) return false;
+
+  Image image;
+  std::vector<png_bytep> rows;
+  try {
+    image.pixels.resize(size_t{width} * height * 4);
+    rows.resize(height);
+  } catch (const std::bad_alloc&) {
+    return false;
+  }
+  for (png_uint_32 y = 0; y < height; ++y) rows[y] = image.pixels.data() + size_t{y} * width * 4;
+  if (!readPixels(guard.png, guard.info, rows.data())) return false;
+
+  image.width = width;
+  image.height = height;
+  *out = std::move(image);
+  return true;
+}
+
+std::shared_ptr<const Image> renderHomeScreenIcon(const URL& bundle) {
+  if (bundle.isNull()) return nullptr;
+  // The bundle itself is opened by path, links included, as the bundle
+  // facility opens it; what lies inside is reached from this descriptor only.
+  UniqueFd bundleFd(::open(bundle.fileSystemRepresentation(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!bundleFd) return nullptr;
+
+  std::vector<std::string> candidates = namedCandidates(bundle);
+  if (candidates.empty()) candidates = scannedCandidates(bundleFd.get());
+
+  // The largest by area wins; among equals the first found.
+  Image best;
+  for (const std::string& name : candidates) {
+    std::vector<uint8_t> bytes;
+    Image decoded;
+    if (!readCandidate(bundleFd.get(), name, &bytes) || !decodePNG(bytes, &decoded)) continue;
+    if (uint64_t{decoded.width} * decoded.height > uint64_t{best.width} * best.height) best = std::move(decoded);
+  }
+  if (!best.isValid()) return nullptr;
+
+  return std::make_shared<const Image>(
+      shapeAndUnpremultiply(scalePremultiplied(best, kHomeScreenIconSize), kHomeScreenIconSize));
+}
+
+}  // namespace sl

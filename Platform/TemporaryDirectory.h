@@ -1,0 +1,21 @@
+// The per-process temporary directory.
+#pragma once
+
+#include "Platform/URL.h"
+
+namespace sl {
+
+// A directory URL for scratch files of this process:
+//   - $TMPDIR, when it is set to an absolute path that is an existing
+//     directory (links followed), taken as it is, not below the system root;
+//   - otherwise ROOT/tmp/ (below the system root). When nothing stands
+//     there it is made, with the mode of a shared temporary directory
+//     (01777, world-writable and sticky, set explicitly so the umask does
+//     not narrow it); the root itself is not made.
+// The answer is worked out afresh on every call, so a change of TMPDIR or
+// of the system root shows at once. The URL is returned even when ROOT/tmp
+// could not be made: whoever then creates something in it meets the
+// failure with an error record of its own.
+URL perProcessTemporaryDirectory();
+
+}  // namespace sl
