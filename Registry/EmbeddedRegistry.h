@@ -1,0 +1,152 @@
+// The embedded application registry: RGApplicationWorkspace and
+// SLInstallerLibrary on one SQLite database, owning the new layout.
+//
+// Layout below the system root (the bases come from the configuration the
+// registry is opened with):
+//   ROOT/private/var/stowd/Library/Registry/registry.sqlite   the database
+//   ROOT/private/var/stowd/Containers/Bundle/<UUID>/NAME.app   bundle containers
+//   ROOT/private/var/mobile/Containers/Data/<UUID>/            data containers
+//   ROOT/private/var/mobile/Containers/Shared/<UUID>/          group containers
+// UUIDs are random (8-4-4-4-12, uppercase hex).
+//
+// Crash safety. Every install writes its intent before it touches the file
+// system: one transaction records a pending operation with every path it
+// will create and every move it will make. Then come the file-system steps,
+// then one transaction that records the new state and marks the operation
+// done, then the cleanup (the replaced bundle container, the package), and
+// finally the operation row goes. Opening the registry runs recovery: an
+// operation not marked done is undone (bundles moved back into the package,
+// the containers it made removed: they hold no user data yet, since data is
+// moved in only after the install returned), one marked done is finished
+// (its cleanup repeated). Every recovery step can be repeated. The guarantee
+// covers a killed process; it does not promise durability of directory
+// entries across a power loss (no directory is fsync'ed).
+//
+// A cross-volume move copies the bundle into a temporary name inside the
+// new bundle container, renames it into place, then renames the source to a
+// trash name beside it (".NAME.rgtrash") and removes that. So a source that
+// is present is always whole, and undoing a move whose source is gone copies
+// the bundle back the same way.
+//
+// Threads: one mutex serialises every call on one registry object. Two
+// processes share the database safely (SQLite locks), but installs from two
+// processes into one root at once are not supported: recovery assumes that
+// every pending operation belongs to a dead process.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "Configuration/SLGlobalConfiguration.h"
+#include "Platform/ApplicationRegistry.h"
+#include "Platform/InstallerLibrary.h"
+#include "Registry/Database.h"
+
+// Codes of RGErrorDomain.
+inline constexpr int64_t kRGDatabaseError = 1;          // SQLite failed
+inline constexpr int64_t kRGInvalidOptionsError = 2;    // missing identifier, unknown package type
+inline constexpr int64_t kRGInvalidPackageError = 3;    // no bundle, no readable Info.plist
+inline constexpr int64_t kRGIdentifierMismatchError = 4;
+inline constexpr int64_t kRGBlacklistedError = 5;
+inline constexpr int64_t kRGAlreadyInstalledError = 6;  // a built-in application is as new or newer
+inline constexpr int64_t kRGPlaceholderRefusedError = 7;  // over a built-in or an installed application
+
+// The names under RGProgressErrorKey for refusals other than
+// RGErrorApplicationAlreadyInstalled.
+inline constexpr char kRGProgressErrorInvalidOptions[] = "InvalidOptions";
+inline constexpr char kRGProgressErrorInvalidPackage[] = "InvalidPackage";
+inline constexpr char kRGProgressErrorIdentifierMismatch[] = "IdentifierMismatch";
+inline constexpr char kRGProgressErrorBlacklisted[] = "Blacklisted";
+inline constexpr char kRGProgressErrorPlaceholderRefused[] = "PlaceholderRefused";
+inline constexpr char kRGProgressErrorInstallFailed[] = "InstallFailed";
+
+class EmbeddedRegistry : public RGApplicationWorkspace,
+                         public SLInstallerLibrary,
+                         public std::enable_shared_from_this<EmbeddedRegistry> {
+ public:
+  // Opens (creating) the registry of the layout that `configuration`
+  // describes and runs recovery. The configuration must outlive the
+  // registry; the built-in applications are its system catalogue. Null on
+  // failure.
+  static std::shared_ptr<EmbeddedRegistry> open(SLGlobalConfiguration& configuration, sl::Error* error);
+
+  // ---- RGApplicationWorkspace ----
+  bool applicationIsInstalled(const sl::String& identifier) override;
+  bool installApplication(const sl::URL& path, const sl::Dictionary& withOptions, sl::Error* error,
+                          const RGProgressHandler& usingBlock) override;
+  using RGApplicationWorkspace::installApplication;
+  std::shared_ptr<RGBundleProxy> bundleProxyForIdentifier(const sl::String& identifier) override;
+
+  // ---- SLInstallerLibrary ----
+  bool registerSafeHarbor(const sl::String& path, const sl::String& identifier, int containerType,
+                          sl::Error* error) override;
+  bool updateContainerDataProtection(const sl::Dictionary& options) override;
+
+  // ---- Layout ----
+  const std::string& databasePath() const { return databasePath_; }
+  const std::string& bundleContainersRoot() const { return bundleRoot_; }
+  const std::string& dataContainersRoot() const { return dataRoot_; }
+  const std::string& groupContainersRoot() const { return groupRoot_; }
+
+  // The safe harbor recorded for `identifier`: (path, container type).
+  std::optional<std::pair<std::string, int>> safeHarborForIdentifier(const std::string& identifier);
+
+  // Test seam: with k > 0, the k-th file-system or commit step counted from
+  // now ends the process with _exit(77) just before it runs. 0 disables.
+  static void setCrashStepForTesting(int k);
+
+  // The data container of an application, made (and recorded) on first
+  // request for a built-in one; empty when unknown. Used by the proxies.
+  std::string dataContainerForIdentifier(const std::string& identifier);
+
+  struct Record;  // one application row (Proxy.cc, Install.cc)
+
+ private:
+  EmbeddedRegistry(SLGlobalConfiguration& configuration, rg::Database db);
+
+  bool createSchema(sl::Error* error);
+  bool recover(sl::Error* error);  // Recovery.cc
+  bool recoverOperation(int64_t operation, bool done, sl::Error* error);
+  bool finishOperation(int64_t operation, sl::Error* error);
+
+  std::optional<Record> recordFor(const std::string& identifier, sl::Error* error);
+  std::optional<Record> systemRecordFor(const std::string& identifier);
+  std::vector<std::pair<std::string, std::string>> groupsOf(const std::string& identifier);
+
+  SLGlobalConfiguration& configuration_;
+  rg::Database db_;
+  std::recursive_mutex mutex_;
+  std::string databasePath_;
+  std::string bundleRoot_;
+  std::string dataRoot_;
+  std::string groupRoot_;
+
+  friend class InstallOperation;
+};
+
+struct EmbeddedRegistry::Record {
+  std::string identifier;
+  std::string type;             // "User", "Placeholder" or "System"
+  std::string bundlePath;
+  std::string bundleContainer;  // empty for a built-in application
+  std::string dataContainer;    // empty while a built-in one has none
+};
+
+namespace rg {
+
+// A new random container name, 8-4-4-4-12 uppercase hex; empty when
+// /dev/urandom cannot be read.
+std::string makeUUID();
+
+// Counts one step for the crash seam (see setCrashStepForTesting).
+void crashPoint();
+
+// Dot-separated numeric version comparison: <0, 0, >0. Missing components
+// count as 0, and the numeric prefix of each component is compared.
+int compareVersions(const std::string& a, const std::string& b);
+
+}  // namespace rg

@@ -1,0 +1,35 @@
+// Moving bundles into a new bundle container and back, in steps that
+// recovery can repeat (see EmbeddedRegistry.h).
+#pragma once
+
+#include <string>
+
+#include "Platform/Error.h"
+
+namespace rg {
+
+struct Move {
+  std::string source;       // in the package
+  std::string destination;  // in the new bundle container
+};
+
+// Where a source goes on its way out after a cross-volume copy:
+// ".NAME.rgtrash" beside it.
+std::string trashPathFor(const std::string& source);
+
+// Renames the source to the destination; across volumes (EXDEV) copies it
+// to ".NAME.partial" in the destination's directory, renames that into
+// place, renames the source to its trash name and removes the trash. Each
+// step counts for the crash seam.
+bool moveIntoContainer(const Move& move, sl::Error* error);
+
+// Brings the source back when it is gone and the destination is there
+// (rename, or across volumes a copy to ".NAME.rgrestore" beside the source
+// renamed into place), then removes the trash. A source that is there is
+// whole and is left alone. The destination's container is not removed here.
+bool undoMove(const Move& move, sl::Error* error);
+
+// Removes a tree; absent (ENOENT, or ENOTDIR on the way) is success.
+bool removeTree(const std::string& path, sl::Error* error);
+
+}  // namespace rg

@@ -1,0 +1,275 @@
+#include "Registry/EmbeddedRegistry.h"
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include "FileManager/SLFileManager.h"
+#include "Registry/RegistryTestSupport.h"
+
+namespace {
+
+using namespace rgtest;
+using sl::test::exists;
+using sl::test::TempDir;
+
+struct Reports {
+  std::vector<sl::Dictionary> all;
+  RGProgressHandler handler() {
+    return [this](const sl::Dictionary& report) { all.push_back(report); };
+  }
+  std::string lastError() const {
+    return all.empty() ? "" : all.back().get(RGProgressErrorKey).asString().str();
+  }
+};
+
+TEST(EmbeddedRegistryTest, PlaceholderThenRealBundleKeepsDataContainer) {
+  RegistryRoot root;
+  auto registry = root.open();
+  SLFileManager& fm = SLFileManager::defaultManager();
+
+  // ---- The placeholder ----
+  const std::string placeholder = root / "tmp/com.example.app.app";
+  makeBundle(placeholder, "com.example.app");
+  sl::Error error;
+  ASSERT_TRUE(registry->installApplication(fileURL(placeholder, true), options("com.example.app", RGPackageTypePlaceholder),
+                                           &error))
+      << error.description();
+  EXPECT_FALSE(exists(placeholder));
+  auto first = registry->bundleProxyForIdentifier("com.example.app");
+  ASSERT_TRUE(first);
+  EXPECT_EQ(first->bundleType().str(), "Placeholder");
+  EXPECT_TRUE(fm.bundleAtURLIsPlaceholder(first->bundleURL()));
+  EXPECT_EQ(fm.installTypeForBundle(first->bundleURL()).uint64Value(), 6u);
+  EXPECT_EQ(first->bundleURL().path(), first->bundleContainerURL().path() + "/com.example.app.app");
+  const std::string data = first->dataContainerURL().path();
+  EXPECT_EQ(data.rfind(registry->dataContainersRoot() + "/", 0), 0u) << data;
+  for (const char* item : {"Documents", "Library", "tmp"}) EXPECT_TRUE(exists(data + "/" + item)) << item;
+  ASSERT_TRUE(first->groupContainerURLs());
+  EXPECT_TRUE(first->groupContainerURLs().isEmpty());
+  sl::test::writeFile(data + "/Documents/user.txt", "moved by the migrator");
+
+  // ---- The real bundle over it, from a customer package on the same volume ----
+  const std::string package = root / "private/var/mobile/Applications/C/Staging";
+  const std::string app = makeCustomerPackage(package, "com.example.app", "2.0");
+  makeBundle(package + "/Payload/Tunnel.vpnplugin", "com.example.app.vpn");
+  sl::test::writeFile(package + "/Manifest.plist", "<plist/>");
+  const ino_t inode = inodeOf(app);
+  Reports reports;
+  ASSERT_TRUE(registry->installApplication(fileURL(package, true), options("com.example.app", RGPackageTypeCustomer),
+                                           &error, reports.handler()))
+      << error.description();
+  EXPECT_FALSE(exists(package));
+  auto second = registry->bundleProxyForIdentifier("com.example.app");
+  ASSERT_TRUE(second);
+  EXPECT_EQ(second->bundleType().str(), "User");
+  EXPECT_TRUE(second->foundBackingBundle());
+  EXPECT_EQ(second->dataContainerURL().path(), data);
+  EXPECT_EQ(sl::test::readFile(data + "/Documents/user.txt"), "moved by the migrator");
+  EXPECT_EQ(inodeOf(second->bundleURL().path()), inode) << "a move on one volume is a rename";
+  EXPECT_FALSE(fm.bundleAtURLIsPlaceholder(second->bundleURL()));
+  EXPECT_EQ(fm.installTypeForBundle(second->bundleURL()).uint64Value(), 6u);
+  const std::string container = second->bundleContainerURL().path();
+  EXPECT_TRUE(exists(container + "/Tunnel.vpnplugin/Info.plist"));
+  EXPECT_TRUE(exists(container + "/Manifest.plist"));
+  EXPECT_FALSE(exists(first->bundleContainerURL().path())) << "the placeholder's container goes";
+  EXPECT_FALSE(first->foundBackingBundle());
+  ASSERT_FALSE(reports.all.empty());
+  EXPECT_EQ(reports.all.back().get(RGProgressPercentCompleteKey).asNumber().int64Value(), 100);
+  EXPECT_EQ(reports.lastError(), "");
+
+  // ---- Repeats nothing: the same package path and identifier again ----
+  sl::test::makeDirs(package + "/Payload");
+  ASSERT_TRUE(registry->installApplication(fileURL(package, true), options("com.example.app", RGPackageTypeCustomer),
+                                           &error));
+  EXPECT_FALSE(exists(package));
+  EXPECT_EQ(registry->bundleProxyForIdentifier("com.example.app")->bundleContainerURL().path(), container);
+
+  // ---- Through the default workspace, and after reopening ----
+  RGApplicationWorkspace::setDefaultWorkspace(registry);
+  EXPECT_TRUE(RGApplicationWorkspace::defaultWorkspace().applicationIsInstalled("com.example.app"));
+  EXPECT_FALSE(RGBundleProxy::bundleProxyForIdentifier("com.example.other"));
+  RGApplicationWorkspace::setDefaultWorkspace(nullptr);
+  registry.reset();
+  registry = root.open();
+  EXPECT_EQ(registry->bundleProxyForIdentifier("com.example.app")->dataContainerURL().path(), data);
+}
+
+TEST(EmbeddedRegistryTest, TwoApplicationsShareOneGroup) {
+  RegistryRoot root;
+  auto registry = root.open();
+  sl::Error error;
+  makeCustomerPackage(root / "pkgA", "com.example.a", "1", {"group.shared", "group.a"});
+  makeCustomerPackage(root / "pkgB", "com.example.b", "1", {"group.shared"});
+  ASSERT_TRUE(registry->installApplication(fileURL(root / "pkgA", true), options("com.example.a", RGPackageTypeCustomer),
+                                           &error));
+  ASSERT_TRUE(registry->installApplication(fileURL(root / "pkgB", true), options("com.example.b", RGPackageTypeCustomer),
+                                           &error));
+  const sl::Dictionary a = registry->bundleProxyForIdentifier("com.example.a")->groupContainerURLs();
+  const sl::Dictionary b = registry->bundleProxyForIdentifier("com.example.b")->groupContainerURLs();
+  ASSERT_EQ(a.count(), 2u);
+  ASSERT_EQ(b.count(), 1u);
+  EXPECT_EQ(a.get("group.shared").asURL().path(), b.get("group.shared").asURL().path());
+  EXPECT_NE(a.get("group.shared").asURL().path(), a.get("group.a").asURL().path());
+  EXPECT_TRUE(exists(b.get("group.shared").asURL().path()));
+  EXPECT_NE(registry->bundleProxyForIdentifier("com.example.a")->dataContainerURL().path(),
+            registry->bundleProxyForIdentifier("com.example.b")->dataContainerURL().path());
+
+  // A file-system step that fails (a new group container cannot be made)
+  // undoes what was done and still consumes the package.
+  const size_t bundleContainers = SLFileManager::defaultManager()
+                                      .urlsForItemsInDirectoryAtURL(fileURL(registry->bundleContainersRoot(), true), false)
+                                      ->size();
+  sl::test::forceRemove(registry->groupContainersRoot());
+  sl::test::writeFile(registry->groupContainersRoot());
+  makeCustomerPackage(root / "pkgC", "com.example.c", "1", {"group.new"});
+  Reports reports;
+  EXPECT_FALSE(registry->installApplication(fileURL(root / "pkgC", true), options("com.example.c", RGPackageTypeCustomer),
+                                            &error, reports.handler()));
+  EXPECT_TRUE(error.isPOSIX(ENOTDIR)) << error.description();
+  EXPECT_EQ(reports.lastError(), kRGProgressErrorInstallFailed);
+  EXPECT_FALSE(exists(root / "pkgC"));
+  EXPECT_FALSE(registry->applicationIsInstalled("com.example.c"));
+  EXPECT_EQ(SLFileManager::defaultManager()
+                .urlsForItemsInDirectoryAtURL(fileURL(registry->bundleContainersRoot(), true), false)
+                ->size(),
+            bundleContainers);
+}
+
+// Refusals, the blacklist and built-in applications. Every refusal consumes
+// the package and reports under "Error" before the call returns.
+TEST(EmbeddedRegistryTest, RefusalsBlacklistAndBuiltInApplications) {
+  RegistryRoot root;
+  makeBundle(root / "Applications/Newer.app", "com.example.builtin.newer", "5.2");
+  makeBundle(root / "Applications/Older.app", "com.example.builtin.older", "1.9");
+  auto registry = root.open();
+  const std::string blacklisted = *SLGlobalConfiguration::installationBlacklist().begin();
+
+  struct Case {
+    const char* name;
+    std::string bundleIdentifier;
+    std::string option;
+    std::string version;
+    const char* packageType;
+    bool skipBlacklist;
+    int64_t code;  // 0: installed
+    const char* progressError;
+    std::string message;
+  };
+  const std::vector<Case> cases = {
+      {"mismatch", "com.x", "com.y", "1", RGPackageTypeCustomer, true, kRGIdentifierMismatchError,
+       kRGProgressErrorIdentifierMismatch, "Package identifier com.x does not match the option com.y"},
+      {"blacklisted", blacklisted, blacklisted, "1", RGPackageTypeCustomer, false, kRGBlacklistedError,
+       kRGProgressErrorBlacklisted, blacklisted + " is on the installation blacklist"},
+      {"blacklist skipped", blacklisted, blacklisted, "1", RGPackageTypeCustomer, true, 0, "", ""},
+      {"built-in newer", "com.example.builtin.newer", "com.example.builtin.newer", "5.1.9", RGPackageTypeCustomer,
+       true, kRGAlreadyInstalledError, RGErrorApplicationAlreadyInstalled,
+       "The built-in com.example.builtin.newer has version 5.2, not older than the package's 5.1.9"},
+      {"built-in placeholder", "com.example.builtin.older", "com.example.builtin.older", "9",
+       RGPackageTypePlaceholder, true, kRGPlaceholderRefusedError, kRGProgressErrorPlaceholderRefused,
+       "A placeholder is never installed over the built-in application com.example.builtin.older"},
+      {"built-in older", "com.example.builtin.older", "com.example.builtin.older", "1.10", RGPackageTypeCustomer,
+       true, 0, "", ""},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    const std::string package = root / (std::string("pkg-") + c.name);
+    const bool placeholder = std::string(c.packageType) == RGPackageTypePlaceholder;
+    if (placeholder) {
+      makeBundle(package, c.bundleIdentifier, c.version);
+    } else {
+      makeCustomerPackage(package, c.bundleIdentifier, c.version);
+    }
+    sl::Dictionary opts = options(c.option, c.packageType);
+    if (!c.skipBlacklist) opts.remove(RGSkipBlacklistOptionKey);
+    Reports reports;
+    sl::Error error;
+    const bool installed = registry->installApplication(fileURL(package, true), opts, &error, reports.handler());
+    EXPECT_FALSE(exists(package));
+    if (c.code == 0) {
+      EXPECT_TRUE(installed) << error.description();
+      auto proxy = registry->bundleProxyForIdentifier(c.option);
+      ASSERT_TRUE(proxy);
+      EXPECT_EQ(proxy->bundleType().str(), "User");
+      continue;
+    }
+    EXPECT_FALSE(installed);
+    EXPECT_EQ(error.domain(), RGErrorDomain);
+    EXPECT_EQ(error.code(), c.code);
+    EXPECT_EQ(error.localizedDescription().str(), c.message);
+    EXPECT_EQ(reports.lastError(), c.progressError);
+    EXPECT_EQ(reports.all.back().get(RGProgressErrorDescriptionKey).asString().str(), c.message);
+  }
+
+  // A built-in application is installed, of type "System", with a data
+  // container made on first request and kept.
+  EXPECT_TRUE(registry->applicationIsInstalled("com.example.builtin.newer"));
+  auto system = registry->bundleProxyForIdentifier("com.example.builtin.newer");
+  ASSERT_TRUE(system);
+  EXPECT_EQ(system->bundleType().str(), "System");
+  EXPECT_EQ(system->bundleURL().path(), root / "Applications/Newer.app");
+  EXPECT_TRUE(system->foundBackingBundle());
+  const std::string data = system->dataContainerURL().path();
+  ASSERT_FALSE(data.empty());
+  EXPECT_TRUE(exists(data + "/Documents"));
+  EXPECT_EQ(registry->bundleProxyForIdentifier("com.example.builtin.newer")->dataContainerURL().path(), data);
+  EXPECT_FALSE(registry->applicationIsInstalled("com.example.unknown"));
+}
+
+TEST(EmbeddedRegistryTest, PackageOnAnotherVolumeIsCopied) {
+  RegistryRoot root;
+  TempDir other;  // $TMPDIR or /tmp, on the disk
+  struct stat rootStat {};
+  struct stat otherStat {};
+  ASSERT_EQ(::stat(root.path().c_str(), &rootStat), 0);
+  ASSERT_EQ(::stat(other.path().c_str(), &otherStat), 0);
+  if (rootStat.st_dev == otherStat.st_dev) GTEST_SKIP() << "/dev/shm and the temporary directory share a volume";
+  auto registry = root.open();
+  const std::string package = other / "Staging";
+  makeCustomerPackage(package, "com.example.far");
+  sl::test::writeFile(package + "/JukoraMetadata.plist", "meta");
+  sl::Error error;
+  ASSERT_TRUE(registry->installApplication(fileURL(package, true), options("com.example.far", RGPackageTypeCustomer),
+                                           &error))
+      << error.description();
+  EXPECT_FALSE(exists(package));
+  EXPECT_FALSE(exists(other / ".Staging.rgtrash"));
+  auto proxy = registry->bundleProxyForIdentifier("com.example.far");
+  ASSERT_TRUE(proxy);
+  EXPECT_EQ(sl::test::readFile(proxy->bundleURL().path() + "/Executable"), "binary of com.example.far");
+  EXPECT_EQ(sl::test::readFile(proxy->bundleContainerURL().path() + "/JukoraMetadata.plist"), "meta");
+  EXPECT_FALSE(exists(proxy->bundleContainerURL().path() + "/.App.app.partial"));
+}
+
+TEST(EmbeddedRegistryTest, SafeHarborsAndDataProtection) {
+  RegistryRoot root;
+  auto registry = root.open();
+  SLInstallerLibrary::setDefaultLibrary(registry);
+  sl::test::makeDirs(root / "harbor");
+  EXPECT_NE(StowlineRegisterSafeHarborForContainerType(root / "harbor", "com.example.h", 2, nullptr), 0);
+  EXPECT_EQ(registry->safeHarborForIdentifier("com.example.h"), std::make_pair(root / "harbor", 2));
+
+  EXPECT_EQ(StowlineRegisterSafeHarborForContainerType(root / "missing", "com.example.h", 2, nullptr), 0);
+  const sl::Error failure = StowlineCopyLastSafeHarborRegistrationError();
+  EXPECT_TRUE(failure.isPOSIX(ENOENT)) << failure.description();
+  EXPECT_EQ(failure.localizedDescription().str(), "Safe harbor " + root / "missing" +
+                                                      " for com.example.h cannot be registered: stat failed: "
+                                                      "No such file or directory");
+  sl::test::writeFile(root / "file");
+  sl::Error error;
+  EXPECT_FALSE(registry->registerSafeHarbor(root / "file", "com.example.h", 2, &error));
+  EXPECT_TRUE(error.isPOSIX(ENOTDIR));
+  EXPECT_EQ(registry->safeHarborForIdentifier("com.example.h")->first, root / "harbor") << "the entry stays";
+
+  makeCustomerPackage(root / "pkg", "com.example.p");
+  ASSERT_TRUE(registry->installApplication(fileURL(root / "pkg", true), options("com.example.p", RGPackageTypeCustomer),
+                                           &error));
+  const sl::URL data = registry->bundleProxyForIdentifier("com.example.p")->dataContainerURL();
+  EXPECT_TRUE(StowlineUpdateContainerDataProtectionForMigratorOnly(
+      sl::Dictionary{{kSLUpdateSystemAppDataContainerDataProtection, sl::Boolean(true)}}));
+  int32_t protectionClass = 0;
+  ASSERT_TRUE(SLFileManager::defaultManager().dataProtectionClassOfItemAtURL(data, &protectionClass));
+  EXPECT_EQ(protectionClass, 4);
+  SLInstallerLibrary::setDefaultLibrary(nullptr);
+}
+
+}  // namespace

@@ -1,0 +1,197 @@
+// Kills an install at each of its steps in a child process, reopens the
+// registry (recovery) and checks that the outcome is either the old state
+// with the package in place or the new state, with no stray container.
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <functional>
+#include <optional>
+#include <set>
+
+#include "FileManager/SLFileManager.h"
+#include "Platform/Bundle.h"
+#include "Registry/Database.h"
+#include "Registry/RegistryTestSupport.h"
+
+namespace {
+
+using namespace rgtest;
+using sl::test::exists;
+
+struct Scenario {
+  const char* name;
+  std::string identifier;
+  const char* packageType;
+  const char* newType;
+  // Builds the state before the install and the package; answers the
+  // package's path. `packageParent` is where a package may be put.
+  std::function<std::string(RegistryRoot&, EmbeddedRegistry&, const std::string& packageParent)> prepare;
+};
+
+std::set<std::string> column(rg::Database& db, const char* sql) {
+  std::set<std::string> values;
+  std::optional<rg::Statement> statement = db.prepare(sql, nullptr);
+  while (statement && statement->step(nullptr)) values.insert(statement->text(0).value_or(""));
+  return values;
+}
+
+std::vector<std::string> entries(const std::string& directory) {
+  std::vector<std::string> names;
+  auto listed = SLFileManager::defaultManager().urlsForItemsInDirectoryAtURL(fileURL(directory, true), false);
+  if (listed) {
+    for (const sl::URL& url : *listed) names.push_back(url.path());
+  }
+  return names;
+}
+
+bool bundleReadable(const std::string& path) {
+  auto bundle = sl::Bundle::createUnique(fileURL(path, true));
+  return bundle && !bundle->infoDictionary().isNull();
+}
+
+// The invariant after recovery. Answers whether the install took effect.
+bool checkInvariant(RegistryRoot& root, EmbeddedRegistry& registry, const Scenario& scenario,
+                    const std::string& package, const std::string& packageBundle,
+                    const std::shared_ptr<RGBundleProxy>& before) {
+  std::optional<rg::Database> db = rg::Database::open(registry.databasePath(), nullptr);
+  EXPECT_TRUE(db);
+  if (!db) return false;
+  EXPECT_EQ(column(*db, "PRAGMA integrity_check"), std::set<std::string>{"ok"});
+  EXPECT_TRUE(column(*db, "SELECT id FROM operations").empty()) << "recovery leaves no operation behind";
+
+  auto proxy = registry.bundleProxyForIdentifier(scenario.identifier);
+  const bool installed = proxy && proxy->bundleType() == scenario.newType;
+  if (installed) {
+    EXPECT_FALSE(exists(package)) << "the new state consumed the package";
+    EXPECT_TRUE(bundleReadable(proxy->bundleURL().path()));
+    EXPECT_EQ(proxy->bundleURL().URLByDeletingLastPathComponent().path(), proxy->bundleContainerURL().path());
+  } else {
+    EXPECT_TRUE(bundleReadable(packageBundle)) << "the old state keeps the package: " << packageBundle;
+    EXPECT_EQ(static_cast<bool>(proxy), static_cast<bool>(before));
+    if (proxy && before) {
+      EXPECT_EQ(proxy->bundleContainerURL().path(), before->bundleContainerURL().path());
+      EXPECT_TRUE(proxy->foundBackingBundle());
+    }
+  }
+  if (before) {
+    EXPECT_EQ(proxy->dataContainerURL().path(), before->dataContainerURL().path());
+    EXPECT_EQ(sl::test::readFile(proxy->dataContainerURL().path() + "/Documents/keep"), "user data");
+  }
+  // Nothing under the containers roots that no record names, and no data
+  // container named twice.
+  const std::set<std::string> bundles =
+      column(*db, "SELECT bundle_container FROM applications WHERE bundle_container IS NOT NULL");
+  const std::set<std::string> data =
+      column(*db, "SELECT data_container FROM applications WHERE data_container IS NOT NULL");
+  const std::set<std::string> groups = column(*db, "SELECT path FROM groups");
+  for (const auto& [rootPath, named] : {std::pair{registry.bundleContainersRoot(), &bundles},
+                                        std::pair{registry.dataContainersRoot(), &data},
+                                        std::pair{registry.groupContainersRoot(), &groups}}) {
+    for (const std::string& entry : entries(rootPath)) EXPECT_EQ(named->count(entry), 1u) << "stray " << entry;
+  }
+  EXPECT_TRUE(column(*db, "SELECT data_container FROM applications WHERE data_container IS NOT NULL "
+                          "GROUP BY data_container HAVING COUNT(*) > 1")
+                  .empty());
+  for (const std::string& entry : entries(fileURL(package).URLByDeletingLastPathComponent().path())) {
+    EXPECT_EQ(entry.find(".rgtrash"), std::string::npos) << entry;
+    EXPECT_EQ(entry.find(".rgrestore"), std::string::npos) << entry;
+  }
+  (void)root;
+  return installed;
+}
+
+void runScenario(const Scenario& scenario, bool otherVolume) {
+  bool completed = false;
+  int crashes = 0;
+  for (int k = 1; k <= 100 && !completed; ++k) {
+    SCOPED_TRACE(std::string(scenario.name) + " killed before step " + std::to_string(k));
+    RegistryRoot root;
+    std::optional<sl::test::TempDir> far;  // on the disk, only when asked for
+    if (otherVolume) far.emplace();
+    const std::string parent = otherVolume ? far->path() : root / "private/var/mobile/Applications/C";
+    std::string package;
+    std::shared_ptr<RGBundleProxy> before;
+    {
+      auto registry = root.open();
+      ASSERT_TRUE(registry);
+      package = scenario.prepare(root, *registry, parent);
+      before = registry->bundleProxyForIdentifier(scenario.identifier);
+      if (before) sl::test::writeFile(before->dataContainerURL().path() + "/Documents/keep", "user data");
+    }
+    const std::string packageBundle =
+        std::string(scenario.packageType) == RGPackageTypePlaceholder ? package : package + "/Payload/App.app";
+
+    const pid_t child = ::fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+      EmbeddedRegistry::setCrashStepForTesting(k);
+      auto registry = EmbeddedRegistry::open(root.configuration(), nullptr);
+      const bool ok = registry && registry->installApplication(fileURL(package, true),
+                                                               options(scenario.identifier, scenario.packageType),
+                                                               nullptr);
+      ::_exit(ok ? 0 : 1);
+    }
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFEXITED(status));
+    ASSERT_TRUE(WEXITSTATUS(status) == 0 || WEXITSTATUS(status) == 77) << WEXITSTATUS(status);
+    completed = WEXITSTATUS(status) == 0;
+    if (!completed) ++crashes;
+
+    auto registry = root.open();
+    ASSERT_TRUE(registry);
+    const bool installed = checkInvariant(root, *registry, scenario, package, packageBundle, before);
+    if (completed) {
+      EXPECT_TRUE(installed);
+    }
+  }
+  EXPECT_TRUE(completed);
+  EXPECT_GE(crashes, 8) << "the install has fewer steps than expected";
+}
+
+const std::vector<Scenario>& scenarios() {
+  static const std::vector<Scenario> all = {
+      {"placeholder", "com.crash.placeholder", RGPackageTypePlaceholder, "Placeholder",
+       [](RegistryRoot&, EmbeddedRegistry&, const std::string& parent) {
+         makeBundle(parent + "/com.crash.placeholder.app", "com.crash.placeholder");
+         return parent + "/com.crash.placeholder.app";
+       }},
+      {"real over placeholder", "com.crash.real", RGPackageTypeCustomer, "User",
+       [](RegistryRoot& root, EmbeddedRegistry& registry, const std::string& parent) {
+         makeBundle(root / "tmp/com.crash.real.app", "com.crash.real");
+         EXPECT_TRUE(registry.installApplication(fileURL(root / "tmp/com.crash.real.app", true),
+                                                 options("com.crash.real", RGPackageTypePlaceholder), nullptr));
+         makeCustomerPackage(parent + "/Staging", "com.crash.real", "2", {"group.crash"});
+         sl::test::writeFile(parent + "/Staging/Manifest.plist", "m");
+         return parent + "/Staging";
+       }},
+      {"customer with a group", "com.crash.grouped", RGPackageTypeCustomer, "User",
+       [](RegistryRoot&, EmbeddedRegistry&, const std::string& parent) {
+         makeCustomerPackage(parent + "/Staging", "com.crash.grouped", "1", {"group.one", "group.two"});
+         makeBundle(parent + "/Staging/Payload/Tunnel.vpnplugin", "com.crash.grouped.vpn");
+         return parent + "/Staging";
+       }},
+  };
+  return all;
+}
+
+TEST(RegistryCrashTest, KilledInstallsRecoverToOldOrNewState) {
+  for (const Scenario& scenario : scenarios()) runScenario(scenario, false);
+}
+
+TEST(RegistryCrashTest, KilledCopyingInstallsRecoverToOldOrNewState) {
+  sl::test::TempDir far;
+  sl::test::TempDir shm(sl::test::TempDir::kShm);
+  struct stat a {};
+  struct stat b {};
+  ASSERT_EQ(::stat(far.path().c_str(), &a), 0);
+  ASSERT_EQ(::stat(shm.path().c_str(), &b), 0);
+  if (a.st_dev == b.st_dev) GTEST_SKIP() << "/dev/shm and the temporary directory share a volume";
+  runScenario(scenarios()[0], true);
+  runScenario(scenarios()[1], true);
+}
+
+}  // namespace
