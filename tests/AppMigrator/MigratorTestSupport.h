@@ -69,12 +69,10 @@ using sl::test::fileURL;
 // The system root of this test program, made below /dev/shm on first use and
 // set before anything reads the configuration.
 inline const std::string& root() {
-  static sl::test::TempDir* const dir = [] {
-    auto* d = new sl::test::TempDir(sl::test::TempDir::kShm);  // removed at exit by the fixture's environment
-    sl::setSystemRoot(d->path());
-    return d;
-  }();
-  return dir->path();
+  static sl::test::TempDir dir(sl::test::TempDir::kShm);  // removed when the program exits
+  static const bool set = (sl::setSystemRoot(dir.path()), true);
+  (void)set;
+  return dir.path();
 }
 
 // ROOT + an absolute path of the system ("/private/var/mobile/Applications").
