@@ -26,6 +26,7 @@ inline constexpr const char kPOSIXErrorDomain[] = "POSIXErrorDomain";
 inline constexpr const char kFileErrorDomain[] = "FileErrorDomain";
 inline constexpr int64_t kFileReadNoSuchFileError = 260;
 inline constexpr int64_t kFileReadUnknownError = 256;
+inline constexpr int64_t kFileReadNoPermissionError = 257;
 
 inline constexpr const char kLocalizedDescriptionKey[] = "LocalizedDescription";
 inline constexpr const char kUnderlyingErrorKey[] = "UnderlyingError";
