@@ -25,6 +25,8 @@
 class SLAppMigratorTestAccess {
  public:
   static SLAppMigrator& of(DataClassMigrator& m) { return static_cast<SLAppMigrator&>(m); }
+  // A migrator made without running init (its start-up state stays empty).
+  static std::unique_ptr<SLAppMigrator> bare() { return std::unique_ptr<SLAppMigrator>(new SLAppMigrator()); }
   static sl::Dictionary introspect(SLAppMigrator& m, const sl::URL& url, bool* early) {
     return m._introspectContainer(url, early);
   }
@@ -60,6 +62,11 @@ class SLAppMigratorTestAccess {
   static const std::optional<std::vector<sl::URL>>& itemsToMigrate(SLAppMigrator& m) { return m._itemsToMigrate; }
   static uint64_t countItemsMigrated(SLAppMigrator& m) { return m._countItemsMigrated; }
   static const sl::String& lastSystemBuildVersion(SLAppMigrator& m) { return m._lastSystemBuildVersion; }
+  // Sets the item list and the counter as init and the passes leave them.
+  static void setProgressState(SLAppMigrator& m, std::optional<std::vector<sl::URL>> items, uint64_t count) {
+    m._itemsToMigrate = std::move(items);
+    m._countItemsMigrated = count;
+  }
 };
 
 namespace mgtest {
