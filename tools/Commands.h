@@ -1,0 +1,33 @@
+// The stowline program's commands. Each takes the arguments after its name
+// and returns the process's exit status: 0 for success, 1 when the work ran
+// and failed (a migration that returned false, a digest that could not read
+// a file), 2 for a usage error or anything the user must fix first.
+#pragma once
+
+#include <span>
+#include <string>
+#include <string_view>
+
+namespace stowline {
+
+using Arguments = std::span<char* const>;
+
+int migrateCommand(Arguments args);
+int planCommand(Arguments args);
+int registryCommand(Arguments args);
+int fixtureCommand(Arguments args);
+int digestCommand(Arguments args);
+int configCommand(Arguments args);
+
+// "stowline <command>: <message>" and a hint at --help on standard error;
+// returns 2.
+int usageError(std::string_view command, std::string_view message);
+
+// Sets the system root from --root (already checked to be an existing
+// directory) before anything reads the configuration. Returns false with a
+// usage error printed when it is not a directory.
+bool applyRoot(std::string_view command, const std::string& root);
+
+inline constexpr char kVersion[] = "0.1.0";
+
+}  // namespace stowline

@@ -1,0 +1,7 @@
+#include "tools/Commands.h"
+
+namespace stowline {
+
+int digestCommand(Arguments) { return usageError("digest", "not built yet"); }
+
+}  // namespace stowline

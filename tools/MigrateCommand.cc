@@ -1,0 +1,7 @@
+#include "tools/Commands.h"
+
+namespace stowline {
+
+int migrateCommand(Arguments) { return usageError("migrate", "not built yet"); }
+
+}  // namespace stowline
