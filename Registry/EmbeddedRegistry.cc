@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <map>
 
 #include "FileManager/SLFileManager.h"
 #include "Platform/UniqueFd.h"
@@ -258,4 +259,42 @@ std::string EmbeddedRegistry::dataContainerForIdentifier(const std::string& iden
     }
   }
   return record->dataContainer;
+}
+
+std::vector<EmbeddedRegistry::Record> EmbeddedRegistry::installedApplications() {
+  std::lock_guard lock(mutex_);
+  std::map<std::string, Record> records;
+  std::optional<rg::Statement> statement = db_.prepare(
+      "SELECT identifier, type, bundle_path, bundle_container, data_container FROM applications", nullptr);
+  if (!statement) return {};
+  while (statement->step(nullptr)) {
+    Record record{statement->text(0).value_or(""), statement->text(1).value_or(""), statement->text(2).value_or(""),
+                  statement->text(3).value_or(""), statement->text(4).value_or("")};
+    records.emplace(record.identifier, std::move(record));
+  }
+  if (statement->failed()) return {};
+  // Built-in applications without a row yet (their data container was never
+  // asked for).
+  const sl::Dictionary builtIn = configuration_.systemAppBundleIDToInfoMap();
+  for (const auto& [identifier, entry] : builtIn) {
+    if (records.contains(identifier)) continue;
+    if (std::optional<Record> record = systemRecordFor(identifier)) records.emplace(identifier, std::move(*record));
+  }
+  std::vector<Record> result;
+  result.reserve(records.size());
+  for (auto& [identifier, record] : records) result.push_back(std::move(record));
+  return result;
+}
+
+std::vector<EmbeddedRegistry::SafeHarbor> EmbeddedRegistry::safeHarbors() {
+  std::lock_guard lock(mutex_);
+  std::vector<SafeHarbor> harbors;
+  std::optional<rg::Statement> statement =
+      db_.prepare("SELECT identifier, path, container_type FROM safe_harbors ORDER BY identifier", nullptr);
+  if (!statement) return harbors;
+  while (statement->step(nullptr)) {
+    harbors.push_back({statement->text(0).value_or(""), statement->text(1).value_or(""),
+                       static_cast<int>(statement->integer(2))});
+  }
+  return harbors;
 }

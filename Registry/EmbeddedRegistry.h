@@ -95,6 +95,20 @@ class EmbeddedRegistry : public RGApplicationWorkspace,
   // The safe harbor recorded for `identifier`: (path, container type).
   std::optional<std::pair<std::string, int>> safeHarborForIdentifier(const std::string& identifier);
 
+  // ---- Enumeration (read only: nothing is made or recorded) ----
+  struct Record;  // one application row (Proxy.cc, Install.cc)
+  struct SafeHarbor {
+    std::string identifier;
+    std::string path;
+    int containerType = 0;
+  };
+  // Every application the registry knows, built-in ones included (a
+  // built-in one whose data container was never asked for has none yet), in
+  // identifier order. Empty when the database cannot be read.
+  std::vector<Record> installedApplications();
+  // Every recorded safe harbor, in identifier order.
+  std::vector<SafeHarbor> safeHarbors();
+
   // Test seam: with k > 0, the k-th file-system or commit step counted from
   // now ends the process with _exit(77) just before it runs. 0 disables.
   static void setCrashStepForTesting(int k);
@@ -102,8 +116,6 @@ class EmbeddedRegistry : public RGApplicationWorkspace,
   // The data container of an application, made (and recorded) on first
   // request for a built-in one; empty when unknown. Used by the proxies.
   std::string dataContainerForIdentifier(const std::string& identifier);
-
-  struct Record;  // one application row (Proxy.cc, Install.cc)
 
  private:
   EmbeddedRegistry(SLGlobalConfiguration& configuration, rg::Database db);
