@@ -20,8 +20,13 @@ int digestCommand(Arguments args);
 int configCommand(Arguments args);
 
 // "stowline <command>: <message>" and a hint at --help on standard error;
-// returns 2.
+// returns 2. For mistakes in the command line itself.
 int usageError(std::string_view command, std::string_view message);
+
+// "stowline <command>: <message>", one line on standard error; returns 2.
+// For what the user must fix outside the command line (a root that does not
+// exist, a plug-in that cannot be loaded, a log file that cannot be opened).
+int setupError(std::string_view command, std::string_view message);
 
 // Sets the system root from --root (already checked to be an existing
 // directory) before anything reads the configuration. Returns false with a

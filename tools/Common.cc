@@ -15,15 +15,21 @@ int usageError(std::string_view command, std::string_view message) {
   return 2;
 }
 
+int setupError(std::string_view command, std::string_view message) {
+  std::fprintf(stderr, "stowline %.*s: %.*s\n", static_cast<int>(command.size()), command.data(),
+               static_cast<int>(message.size()), message.data());
+  return 2;
+}
+
 bool applyRoot(std::string_view command, const std::string& root) {
   if (root.empty()) return true;  // STOWLINE_ROOT or "/"
   struct stat st;
   if (::stat(root.c_str(), &st) != 0) {
-    usageError(command, "root " + root + " does not exist");
+    setupError(command, "root " + root + " does not exist");
     return false;
   }
   if (!S_ISDIR(st.st_mode)) {
-    usageError(command, "root " + root + " is not a directory");
+    setupError(command, "root " + root + " is not a directory");
     return false;
   }
   sl::setSystemRoot(root);

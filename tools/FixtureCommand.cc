@@ -1,7 +1,588 @@
+// stowline fixture: writes a sample old layout below a system root, for
+// demonstrations, tests and benchmarks.
+//
+// Everything that varies (container names, versions, groups, file contents)
+// comes from one splitmix64 generator seeded by --seed, drawn in a fixed
+// order, and every item written gets fixed modes and times: the same seed
+// gives a byte-identical tree. The tree is written through directory
+// descriptors (mkdirat, openat, futimens), without fsync, so that ten
+// thousand applications take seconds.
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <charconv>
+#include <cstdint>
+#include <cstdio>
+#include <cstring>
+#include <ctime>
+#include <span>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "Configuration/SLGlobalConfiguration.h"
+#include "Platform/Icon.h"
+#include "Platform/ImageDestination.h"
+#include "Platform/PropertyList.h"
+#include "Platform/SystemRoot.h"
+#include "Platform/UniqueFd.h"
+#include "Platform/Value.h"
 #include "tools/Commands.h"
 
 namespace stowline {
 
-int fixtureCommand(Arguments) { return usageError("fixture", "not built yet"); }
+namespace {
+
+constexpr char kCommand[] = "fixture";
+
+constexpr char kUsage[] =
+    "usage: stowline fixture --root DIR --apps N [--vpn-only M] [--groups G]\n"
+    "                        [--files-per-app F] [--bytes-per-file B] [--seed S]\n"
+    "\n"
+    "Writes an old layout below the system root DIR: N application containers\n"
+    "(bundle, icon, data in Documents, Library, tmp and Tillbox, sometimes store\n"
+    "metadata), M containers holding only a VPN plug-in, G group containers named\n"
+    "in the old install map, a safe harbor map with one or two harbors, and\n"
+    "WhereDidMyApplicationsGo.txt. The same seed gives the same tree, byte for byte.\n"
+    "Refuses a root whose old container root is not empty or whose old install\n"
+    "map or safe harbor map already exists.\n"
+    "\n"
+    "  --root DIR            the system root (required; must be a directory)\n"
+    "  --apps N              application containers (required)\n"
+    "  --vpn-only M          VPN-only containers (default 0); no application has\n"
+    "                        their identifiers, so migrate leaves them in place\n"
+    "  --groups G            group containers (default 0)\n"
+    "  --files-per-app F     data files per application (default 3)\n"
+    "  --bytes-per-file B    size of each data file (default 64)\n"
+    "  --seed S              seed of the generator (default 1)\n";
+
+// The access and modification time of every item written: 2021-01-01
+// 00:00:00 UTC.
+constexpr time_t kFixtureTime = 1609459200;
+
+constexpr char kGroupContainersKey[] = "GroupContainers";
+constexpr char kGroupContainerPathKey[] = "Container";
+constexpr char kHarborMapName[] = "SafeHarbor.plist";
+constexpr char kHarborPathKey[] = "HarborPathKey";
+constexpr char kOldRootNoteName[] = "WhereDidMyApplicationsGo.txt";
+constexpr char kOldGroupsDirectory[] = "/private/var/mobile/Containers/OldGroups";
+constexpr char kHarborsDirectory[] = "/private/var/stowd/Library/SafeHarbors";
+
+constexpr std::array<const char*, 4> kDataDirectories = {"Documents", "Library", "tmp", "Tillbox"};
+
+struct Options {
+  std::string root;
+  bool haveApps = false;
+  uint64_t apps = 0;
+  uint64_t vpnOnly = 0;
+  uint64_t groups = 0;
+  uint64_t filesPerApp = 3;
+  uint64_t bytesPerFile = 64;
+  uint64_t seed = 1;
+};
+
+// splitmix64: small, fast and the same on every platform.
+class Random {
+ public:
+  explicit Random(uint64_t seed) : state_(seed) {}
+
+  uint64_t next() {
+    uint64_t z = (state_ += 0x9E3779B97F4A7C15ULL);
+    z = (z ^ (z >> 30)) * 0xBF58476D1CE4E5B9ULL;
+    z = (z ^ (z >> 27)) * 0x94D049BB133111EBULL;
+    return z ^ (z >> 31);
+  }
+  uint64_t below(uint64_t n) { return n == 0 ? 0 : next() % n; }
+
+  // Bytes in a fixed (little-endian) order, whatever the host's order.
+  void fill(uint8_t* out, size_t n) {
+    while (n > 0) {
+      uint64_t word = next();
+      for (int i = 0; i < 8 && n > 0; ++i, --n, word >>= 8) *out++ = static_cast<uint8_t>(word);
+    }
+  }
+
+  // A version 4 UUID, 8-4-4-4-12 uppercase hex, as the registry names
+  // containers.
+  std::string uuid() {
+    uint8_t bytes[16];
+    fill(bytes, sizeof bytes);
+    bytes[6] = static_cast<uint8_t>((bytes[6] & 0x0F) | 0x40);
+    bytes[8] = static_cast<uint8_t>((bytes[8] & 0x3F) | 0x80);
+    static constexpr char kHex[] = "0123456789ABCDEF";
+    std::string text;
+    for (size_t i = 0; i < sizeof bytes; ++i) {
+      if (i == 4 || i == 6 || i == 8 || i == 10) text += '-';
+      text += kHex[bytes[i] >> 4];
+      text += kHex[bytes[i] & 0x0F];
+    }
+    return text;
+  }
+
+ private:
+  uint64_t state_;
+};
+
+std::span<const uint8_t> bytesOf(std::string_view text) {
+  return {reinterpret_cast<const uint8_t*>(text.data()), text.size()};
+}
+
+// A directory being written: its descriptor and its path for messages.
+struct Directory {
+  sl::UniqueFd fd;
+  std::string path;
+};
+
+class FixtureWriter {
+ public:
+  FixtureWriter(const Options& options, SLGlobalConfiguration& configuration);
+
+  // 0 when the whole layout was written; 1 after a failure (reported on
+  // standard error). What was written before the failure stays.
+  int run();
+
+ private:
+  bool fail(const char* call, const std::string& path, int savedErrno);
+
+  // Opens the directory at an absolute path below the system root, making
+  // the components that are missing. Components made here get the fixed
+  // times at the end.
+  bool openPath(const std::string& absolute, Directory* out);
+  // Makes `name` (which must not exist yet) inside `parent` and opens it.
+  bool makeDirectory(const Directory& parent, const std::string& name, Directory* out);
+  // Gives a directory whose content is complete the fixed times; closes it.
+  bool finish(Directory& directory);
+  bool writeFile(const Directory& parent, const std::string& name, std::span<const uint8_t> bytes, mode_t mode);
+  bool writeRandomFile(const Directory& parent, const std::string& name, uint64_t size);
+  bool writePropertyList(const Directory& parent, const std::string& name, const sl::Value& value);
+
+  bool makeIcon();
+  bool writeGroup(const Directory& groups, uint64_t index);
+  bool writeApplication(const Directory& root, uint64_t index);
+  bool writeVPNContainer(const Directory& root, uint64_t index);
+  bool writeHarbors();
+  bool writeMaps();
+
+  const Options& options_;
+  std::string oldContainerPath_;
+  std::string installMapPath_;
+  std::string dataDirectoryPath_;
+  Random random_;
+  std::vector<uint8_t> icon_;
+  std::vector<std::string> groupIdentifiers_;
+  sl::Dictionary groupContainers_ = sl::Dictionary::create();
+  sl::Dictionary harborMap_ = sl::Dictionary::create();
+  // Directories whose times are set once everything is written: the ones
+  // made by openPath and the ones the top-level items were written into.
+  std::vector<Directory> finishLater_;
+  uint64_t harborCount_ = 0;
+  const struct timespec times_[2] = {{kFixtureTime, 0}, {kFixtureTime, 0}};
+};
+
+FixtureWriter::FixtureWriter(const Options& options, SLGlobalConfiguration& configuration)
+    : options_(options),
+      oldContainerPath_(configuration.oldContainerPath().path()),
+      installMapPath_(configuration.oldInstallMapPath().path()),
+      dataDirectoryPath_(configuration.dataDirectoryPath().path()),
+      random_(options.seed) {}
+
+bool FixtureWriter::fail(const char* call, const std::string& path, int savedErrno) {
+  std::fprintf(stderr, "stowline fixture: %s of %s failed: %s\n", call, path.c_str(), std::strerror(savedErrno));
+  return false;
+}
+
+bool FixtureWriter::openPath(const std::string& absolute, Directory* out) {
+  const std::string& root = sl::systemRoot();
+  Directory current{sl::UniqueFd(::open(root.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC)), root};
+  if (!current.fd) return fail("open", root, errno);
+  std::string_view rest(absolute);
+  if (root != "/") rest.remove_prefix(root.size());
+  for (const std::string& component : sl::pathComponents(rest)) {
+    if (component == "/") continue;
+    const std::string path = (current.path == "/" ? "" : current.path) + "/" + component;
+    bool made = false;
+    if (::mkdirat(current.fd.get(), component.c_str(), 0755) == 0) {
+      made = true;
+    } else if (errno != EEXIST) {
+      return fail("mkdir", path, errno);
+    }
+    Directory next{
+        sl::UniqueFd(::openat(current.fd.get(), component.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC)),
+        path};
+    if (!next.fd) return fail("open", path, errno);
+    if (made) {
+      sl::UniqueFd copy(::dup(next.fd.get()));
+      if (!copy) return fail("dup", path, errno);
+      finishLater_.push_back({std::move(copy), path});
+    }
+    current = std::move(next);
+  }
+  *out = std::move(current);
+  return true;
+}
+
+bool FixtureWriter::makeDirectory(const Directory& parent, const std::string& name, Directory* out) {
+  std::string path = parent.path + "/" + name;
+  if (::mkdirat(parent.fd.get(), name.c_str(), 0755) != 0) return fail("mkdir", path, errno);
+  sl::UniqueFd fd(::openat(parent.fd.get(), name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  if (!fd) return fail("open", path, errno);
+  *out = Directory{std::move(fd), std::move(path)};
+  return true;
+}
+
+bool FixtureWriter::finish(Directory& directory) {
+  if (::futimens(directory.fd.get(), times_) != 0) return fail("futimens", directory.path, errno);
+  directory.fd.reset();
+  return true;
+}
+
+bool FixtureWriter::writeFile(const Directory& parent, const std::string& name, std::span<const uint8_t> bytes,
+                              mode_t mode) {
+  const std::string path = parent.path + "/" + name;
+  sl::UniqueFd fd(::openat(parent.fd.get(), name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode));
+  if (!fd) return fail("open", path, errno);
+  while (!bytes.empty()) {
+    const ssize_t n = ::write(fd.get(), bytes.data(), bytes.size());
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return fail("write", path, errno);
+    }
+    bytes = bytes.subspan(static_cast<size_t>(n));
+  }
+  if (::futimens(fd.get(), times_) != 0) return fail("futimens", path, errno);
+  return true;
+}
+
+bool FixtureWriter::writeRandomFile(const Directory& parent, const std::string& name, uint64_t size) {
+  const std::string path = parent.path + "/" + name;
+  sl::UniqueFd fd(::openat(parent.fd.get(), name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644));
+  if (!fd) return fail("open", path, errno);
+  uint8_t chunk[65536];
+  while (size > 0) {
+    const size_t n = static_cast<size_t>(std::min<uint64_t>(size, sizeof chunk));
+    random_.fill(chunk, n);
+    size_t done = 0;
+    while (done < n) {
+      const ssize_t written = ::write(fd.get(), chunk + done, n - done);
+      if (written < 0) {
+        if (errno == EINTR) continue;
+        return fail("write", path, errno);
+      }
+      done += static_cast<size_t>(written);
+    }
+    size -= n;
+  }
+  if (::futimens(fd.get(), times_) != 0) return fail("futimens", path, errno);
+  return true;
+}
+
+bool FixtureWriter::writePropertyList(const Directory& parent, const std::string& name, const sl::Value& value) {
+  std::vector<uint8_t> bytes;
+  sl::Error error;
+  if (!sl::dataFromPropertyList(value, sl::PropertyListFormat::XML, &bytes, &error)) {
+    std::fprintf(stderr, "stowline fixture: cannot encode %s/%s: %s\n", parent.path.c_str(), name.c_str(),
+                 error.description().c_str());
+    return false;
+  }
+  return writeFile(parent, name, bytes, 0644);
+}
+
+// One small icon for every application: a 32 x 32 square of a seeded colour
+// with a lighter diagonal band.
+bool FixtureWriter::makeIcon() {
+  sl::Image image;
+  image.width = 32;
+  image.height = 32;
+  image.pixels.resize(size_t{32} * 32 * 4);
+  uint8_t colour[3];
+  random_.fill(colour, sizeof colour);
+  for (uint32_t y = 0; y < 32; ++y) {
+    for (uint32_t x = 0; x < 32; ++x) {
+      uint8_t* pixel = &image.pixels[(size_t{y} * 32 + x) * 4];
+      const bool band = x + y >= 28 && x + y <= 34;
+      for (int c = 0; c < 3; ++c) pixel[c] = band ? static_cast<uint8_t>(255 - colour[c] / 4) : colour[c];
+      pixel[3] = 255;
+    }
+  }
+  sl::MutableDataBuffer buffer;
+  KVImageDestinationOwner destination(KVImageDestinationCreateWithData(buffer, kUTTypePNG, 1));
+  if (!destination) {
+    std::fputs("stowline fixture: cannot make a PNG encoder\n", stderr);
+    return false;
+  }
+  KVImageDestinationAddImage(destination.get(), image);
+  if (!KVImageDestinationFinalize(destination.get())) {
+    std::fputs("stowline fixture: cannot encode the icon\n", stderr);
+    return false;
+  }
+  icon_ = std::move(buffer.bytes);
+  return true;
+}
+
+bool FixtureWriter::writeGroup(const Directory& groups, uint64_t index) {
+  const std::string identifier = "group.com.example.fixture.group" + std::to_string(index);
+  Directory container;
+  if (!makeDirectory(groups, random_.uuid(), &container)) return false;
+  Directory library;
+  if (!writeRandomFile(container, "Shared.dat", options_.bytesPerFile) ||
+      !makeDirectory(container, "Library", &library) ||
+      !writeFile(library, "Group.txt", bytesOf(identifier + "\n"), 0644) || !finish(library) || !finish(container)) {
+    return false;
+  }
+  groupIdentifiers_.push_back(identifier);
+  groupContainers_.set(identifier, sl::Dictionary{{kGroupContainerPathKey, sl::String(container.path)}});
+  return true;
+}
+
+bool FixtureWriter::writeApplication(const Directory& root, uint64_t index) {
+  const std::string number = std::to_string(index);
+  const std::string name = "App" + number;
+  const std::string identifier = "com.example.fixture.app" + number;
+  const std::string version = std::to_string(1 + random_.below(3)) + "." + std::to_string(random_.below(10));
+
+  Directory container;
+  if (!makeDirectory(root, random_.uuid(), &container)) return false;
+
+  // The bundle.
+  sl::Array groups = sl::Array::create();
+  if (!groupIdentifiers_.empty()) {
+    const uint64_t wanted = random_.below(3);  // 0, 1 or 2 groups
+    std::vector<uint64_t> picked;
+    for (uint64_t i = 0; i < wanted; ++i) {
+      const uint64_t g = random_.below(groupIdentifiers_.size());
+      if (std::find(picked.begin(), picked.end(), g) == picked.end()) picked.push_back(g);
+    }
+    std::sort(picked.begin(), picked.end());
+    for (uint64_t g : picked) groups.append(sl::String(groupIdentifiers_[g]));
+  }
+  sl::Dictionary info{
+      {"PBBundleIdentifier", sl::String(identifier)},
+      {"PBBundleVersion", sl::String(version)},
+      {"PBBundleShortVersionString", sl::String(version)},
+      {"PBBundleDisplayName", sl::String("Fixture App " + number)},
+      {"PBBundleExecutable", sl::String(name)},
+  };
+  if (!groups.isEmpty()) info.set("PBApplicationGroups", groups);
+  Directory bundle;
+  if (!makeDirectory(container, name + ".app", &bundle) || !writePropertyList(bundle, "Info.plist", info) ||
+      !writeFile(bundle, name, bytesOf("#!/bin/sh\necho " + name + "\n"), 0755) ||
+      !writeFile(bundle, "Icon.png", icon_, 0644) || !finish(bundle)) {
+    return false;
+  }
+
+  // The data, spread over the four data directories in turn.
+  std::array<Directory, kDataDirectories.size()> data;
+  for (size_t i = 0; i < data.size(); ++i) {
+    if (!makeDirectory(container, kDataDirectories[i], &data[i])) return false;
+  }
+  for (uint64_t f = 0; f < options_.filesPerApp; ++f) {
+    if (!writeRandomFile(data[f % data.size()], "file" + std::to_string(f) + ".dat", options_.bytesPerFile)) {
+      return false;
+    }
+  }
+  for (Directory& directory : data) {
+    if (!finish(directory)) return false;
+  }
+
+  // Store metadata beside the bundle: none, the metadata and artwork, or
+  // all four items.
+  const uint64_t metadata = random_.below(3);
+  if (metadata >= 1) {
+    const sl::Dictionary store{{"itemId", sl::Number(static_cast<int64_t>(index))},
+                               {"itemName", sl::String("Fixture App " + number)},
+                               {"bundleVersion", sl::String(version)}};
+    if (!writePropertyList(container, "JukoraMetadata.plist", store) ||
+        !writeRandomFile(container, "JukoraArtwork", options_.bytesPerFile)) {
+      return false;
+    }
+  }
+  if (metadata == 2) {
+    const sl::Dictionary manifest{{"PBBundleIdentifier", sl::String(identifier)}};
+    if (!writePropertyList(container, "Manifest.plist", manifest) ||
+        !writeFile(container, "GeoJSON", bytesOf("{\"type\":\"FeatureCollection\",\"features\":[]}\n"), 0644)) {
+      return false;
+    }
+  }
+  return finish(container);
+}
+
+bool FixtureWriter::writeVPNContainer(const Directory& root, uint64_t index) {
+  const std::string number = std::to_string(index);
+  const std::string name = "Tunnel" + number;
+  Directory container;
+  Directory plugin;
+  const sl::Dictionary info{{"PBBundleIdentifier", sl::String("com.example.fixture.vpn" + number)},
+                            {"PBBundleVersion", sl::String("1.0")},
+                            {"PBBundleDisplayName", sl::String("Fixture Tunnel " + number)},
+                            {"PBBundleExecutable", sl::String(name)}};
+  return makeDirectory(root, random_.uuid(), &container) && makeDirectory(container, name + ".vpnplugin", &plugin) &&
+         writePropertyList(plugin, "Info.plist", info) &&
+         writeFile(plugin, name, bytesOf("#!/bin/sh\necho " + name + "\n"), 0755) && finish(plugin) &&
+         finish(container);
+}
+
+bool FixtureWriter::writeHarbors() {
+  Directory harbors;
+  if (!openPath(sl::pathBelowSystemRoot(kHarborsDirectory), &harbors)) return false;
+  harborCount_ = 1 + random_.below(2);
+  for (uint64_t h = 1; h <= harborCount_; ++h) {
+    Directory harbor;
+    Directory documents;
+    if (!makeDirectory(harbors, random_.uuid(), &harbor) || !makeDirectory(harbor, "Documents", &documents) ||
+        !writeRandomFile(documents, "harbor.dat", options_.bytesPerFile) || !finish(documents) || !finish(harbor)) {
+      return false;
+    }
+    harborMap_.set("com.example.fixture.harbor" + std::to_string(h),
+                   sl::Dictionary{{kHarborPathKey, sl::String(harbor.path)}});
+  }
+  finishLater_.push_back(std::move(harbors));
+  return true;
+}
+
+bool FixtureWriter::writeMaps() {
+  const sl::URL mapURL = sl::URL::fileURLWithPath(installMapPath_, false);
+  Directory caches;
+  Directory data;
+  if (!openPath(mapURL.URLByDeletingLastPathComponent().path(), &caches) ||
+      !writePropertyList(caches, mapURL.lastPathComponent(), sl::Dictionary{{kGroupContainersKey, groupContainers_}}) ||
+      !openPath(dataDirectoryPath_, &data) || !writePropertyList(data, kHarborMapName, harborMap_)) {
+    return false;
+  }
+  finishLater_.push_back(std::move(caches));
+  finishLater_.push_back(std::move(data));
+  return true;
+}
+
+int FixtureWriter::run() {
+  ::umask(022);  // the modes asked for are the modes written
+  if (!makeIcon()) return 1;
+
+  Directory groups;
+  if (options_.groups > 0) {
+    if (!openPath(sl::pathBelowSystemRoot(kOldGroupsDirectory), &groups)) return 1;
+    for (uint64_t g = 1; g <= options_.groups; ++g) {
+      if (!writeGroup(groups, g)) return 1;
+    }
+    finishLater_.push_back(std::move(groups));
+  }
+
+  Directory root;
+  if (!openPath(oldContainerPath_, &root)) return 1;
+  for (uint64_t k = 1; k <= options_.apps; ++k) {
+    if (!writeApplication(root, k)) return 1;
+  }
+  for (uint64_t m = 1; m <= options_.vpnOnly; ++m) {
+    if (!writeVPNContainer(root, m)) return 1;
+  }
+  if (!writeFile(root, kOldRootNoteName, bytesOf("Your applications have moved to their new containers.\n"), 0644)) {
+    return 1;
+  }
+  finishLater_.push_back(std::move(root));
+
+  if (!writeHarbors() || !writeMaps()) return 1;
+  for (Directory& directory : finishLater_) {
+    if (!finish(directory)) return 1;
+  }
+  std::printf(
+      "Wrote %llu application containers, %llu VPN plug-in containers, %llu group containers and %llu safe "
+      "harbors below %s\n",
+      static_cast<unsigned long long>(options_.apps), static_cast<unsigned long long>(options_.vpnOnly),
+      static_cast<unsigned long long>(options_.groups), static_cast<unsigned long long>(harborCount_),
+      sl::systemRoot().c_str());
+  return 0;
+}
+
+bool parseCount(std::string_view option, std::string_view text, uint64_t* out) {
+  const auto [end, ec] = std::from_chars(text.data(), text.data() + text.size(), *out);
+  if (ec != std::errc() || end != text.data() + text.size() || text.empty()) {
+    usageError(kCommand, std::string(option) + " takes a whole number of 0 or more, not '" + std::string(text) + "'");
+    return false;
+  }
+  return true;
+}
+
+// The layout must be new: an old container root with something in it, or a
+// map file already there, belongs to a layout that the fixture would mix into.
+bool checkLayoutIsNew(const std::string& oldRoot, const std::string& installMap, const std::string& harborMap) {
+  struct stat st;
+  if (::lstat(oldRoot.c_str(), &st) == 0) {
+    if (!S_ISDIR(st.st_mode)) {
+      setupError(kCommand, "the old container root " + oldRoot + " exists and is not a directory");
+      return false;
+    }
+    sl::UniqueFd fd(::open(oldRoot.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    sl::UniqueDir dir = fd ? sl::fdopendir(fd) : sl::UniqueDir();
+    if (!dir) {
+      setupError(kCommand, "cannot read the old container root " + oldRoot + ": " + std::strerror(errno));
+      return false;
+    }
+    while (const struct dirent* entry = ::readdir(dir.get())) {
+      if (std::strcmp(entry->d_name, ".") != 0 && std::strcmp(entry->d_name, "..") != 0) {
+        setupError(kCommand, "the old container root " + oldRoot + " is not empty");
+        return false;
+      }
+    }
+  }
+  for (const std::string& file : {installMap, harborMap}) {
+    if (::lstat(file.c_str(), &st) == 0) {
+      setupError(kCommand, file + " already exists");
+      return false;
+    }
+  }
+  return true;
+}
+
+}  // namespace
+
+int fixtureCommand(Arguments args) {
+  Options options;
+  for (size_t i = 0; i < args.size(); ++i) {
+    const std::string_view arg = args[i];
+    if (arg == "--help" || arg == "-h") {
+      std::fputs(kUsage, stdout);
+      return 0;
+    }
+    struct Counted {
+      const char* name;
+      uint64_t* value;
+    };
+    const Counted counted[] = {{"--apps", &options.apps},
+                               {"--vpn-only", &options.vpnOnly},
+                               {"--groups", &options.groups},
+                               {"--files-per-app", &options.filesPerApp},
+                               {"--bytes-per-file", &options.bytesPerFile},
+                               {"--seed", &options.seed}};
+    bool known = arg == "--root";
+    for (const Counted& c : counted) known = known || arg == c.name;
+    if (!known) return usageError(kCommand, "unknown option '" + std::string(arg) + "'");
+    if (i + 1 >= args.size()) return usageError(kCommand, std::string(arg) + " needs a value");
+    const std::string_view value = args[++i];
+    if (arg == "--root") {
+      options.root = value;
+      if (options.root.empty()) return usageError(kCommand, "--root needs a directory");
+      continue;
+    }
+    for (const Counted& c : counted) {
+      if (arg == c.name && !parseCount(arg, value, c.value)) return 2;
+    }
+    if (arg == "--apps") options.haveApps = true;
+  }
+  if (options.root.empty()) return usageError(kCommand, "--root DIR is required");
+  if (!options.haveApps) return usageError(kCommand, "--apps N is required");
+  if (!applyRoot(kCommand, options.root)) return 2;
+
+  SLGlobalConfiguration& configuration = SLGlobalConfiguration::sharedInstance();
+  const std::string harborMap =
+      configuration.dataDirectoryPath().URLByAppendingPathComponent(kHarborMapName, false).path();
+  if (!checkLayoutIsNew(configuration.oldContainerPath().path(), configuration.oldInstallMapPath().path(), harborMap)) {
+    return 2;
+  }
+  return FixtureWriter(options, configuration).run();
+}
 
 }  // namespace stowline

@@ -1,0 +1,211 @@
+// stowline migrate, digest and config, run as a subprocess on roots built
+// by hand, and the installed program.
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <regex>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include "Platform/PropertyList.h"
+#include "TestSupport/TestSupport.h"
+#include "tools/ProgramRunner.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+using sl::test::ProgramResult;
+using sl::test::runProgram;
+using sl::test::TempDir;
+
+const std::string kProgram = SL_STOWLINE_PATH;
+const std::string kOldRoot = "/private/var/mobile/Applications";
+
+ProgramResult stowline(std::vector<std::string> args) {
+  args.insert(args.begin(), kProgram);
+  return runProgram(args, {"NO_COLOR"});
+}
+
+// An old container root with one application container, and the system
+// version the migration records.
+void makeOldLayout(const std::string& root) {
+  const std::string app = root + kOldRoot + "/C/A.app";
+  sl::test::makeDirs(app);
+  ASSERT_TRUE(sl::writePropertyListToURL(sl::Dictionary{{"PBBundleIdentifier", sl::String("com.example.a")},
+                                                        {"PBBundleVersion", sl::String("1.0")},
+                                                        {"PBBundleExecutable", sl::String("Exec")}},
+                                         sl::test::fileURL(app + "/Info.plist")));
+  sl::test::writeFile(app + "/Exec", "binary");
+  sl::test::writeFile(root + kOldRoot + "/C/Documents/notes", "user data");
+  sl::test::writeFile(root + "/etc/os-release", "NAME=Testix\nVERSION_ID=9.1\nBUILD_ID=21A42\n");
+}
+
+// Every entry below `root` with its type, mode and content (links: target).
+std::string listing(const std::string& root) {
+  std::ostringstream out;
+  std::vector<std::string> lines;
+  for (const auto& entry : fs::recursive_directory_iterator(root)) {
+    const fs::file_status st = entry.symlink_status();
+    std::string line = entry.path().string() + " " + std::to_string(static_cast<int>(st.type())) + " " +
+                       std::to_string(static_cast<int>(st.permissions()));
+    if (st.type() == fs::file_type::regular) line += " " + sl::test::readFile(entry.path());
+    if (st.type() == fs::file_type::symlink) line += " -> " + fs::read_symlink(entry.path()).string();
+    lines.push_back(line);
+  }
+  std::sort(lines.begin(), lines.end());
+  for (const std::string& line : lines) out << line << "\n";
+  return out.str();
+}
+
+size_t lineCount(const std::string& text) { return static_cast<size_t>(std::count(text.begin(), text.end(), '\n')); }
+
+bool hasLine(const std::string& text, const std::regex& pattern) {
+  std::istringstream in(text);
+  for (std::string line; std::getline(in, line);)
+    if (std::regex_match(line, pattern)) return true;
+  return false;
+}
+
+void expectNoEscapes(const ProgramResult& r) {
+  EXPECT_EQ(r.out.find("\x1b["), std::string::npos);
+  EXPECT_EQ(r.err.find("\x1b["), std::string::npos);
+}
+
+TEST(MigrateTest, SummaryLogsAndExitStatus) {
+  {
+    SCOPED_TRACE("one application container: success, jsonl log");
+    TempDir root(TempDir::kShm);
+    makeOldLayout(root.path());
+    const std::string log = root / "migrate.log";
+    const ProgramResult r =
+        stowline({"migrate", "--root", root.path(), "--json", "--log-file", log, "--log-format", "jsonl"});
+    EXPECT_EQ(r.status, 0) << r.err;
+    EXPECT_EQ(r.out.substr(0, r.out.find(",\"estimatedDuration\"")),
+              "{\"result\":true,\"itemsToMigrate\":1,\"itemsMigrated\":1");
+    EXPECT_NE(r.out.find(",\"estimatedDuration\":22.25,\"elapsedSeconds\":"), std::string::npos) << r.out;
+    EXPECT_EQ(lineCount(r.out), 1u);
+    // Only errors (the bundle has no icon) reach stderr, without the time.
+    EXPECT_TRUE(std::regex_match(r.err, std::regex("(error Movanta [^\n]+\n)*"))) << r.err;
+    EXPECT_TRUE(hasLine(sl::test::readFile(log),
+                        std::regex(R"(\{"time":"[-0-9T:.]+Z","level":5,"category":"Movanta",)"
+                                   R"("function":"-\[SLAppMigrator init\]","file":"[^"]+","line":[0-9]+,)"
+                                   R"("message":"SLAppMigrator: 1 items to migrate"\})")));
+    EXPECT_FALSE(sl::test::exists(root.path() + kOldRoot));
+    expectNoEscapes(r);
+  }
+  {
+    SCOPED_TRACE("a link in the old container root: failure, text log, errors on stderr too");
+    TempDir root(TempDir::kShm);
+    makeOldLayout(root.path());
+    sl::test::makeSymlink("/nonexistent", root.path() + kOldRoot + "/link");
+    const std::string log = root / "migrate.log";
+    const ProgramResult r = stowline({"migrate", "--root", root.path(), "--json", "--log-file", log});
+    EXPECT_EQ(r.status, 1) << r.err;
+    EXPECT_EQ(r.out.substr(0, r.out.find(",\"estimatedDuration\"")),
+              "{\"result\":false,\"itemsToMigrate\":1,\"itemsMigrated\":1");
+    const std::string text = sl::test::readFile(log);
+    EXPECT_TRUE(hasLine(text, std::regex(R"(\S+Z notice Movanta -\[SLAppMigrator init\]: )"
+                                         R"(SLAppMigrator: 1 items to migrate)")));
+    EXPECT_TRUE(hasLine(text, std::regex(R"(\S+Z error Movanta -\[SLAppMigrator performMigration\]: )"
+                                         R"(SLAppMigrator: Not removing .* because 1 items remain unmigrated\.)")));
+    EXPECT_TRUE(hasLine(r.err, std::regex(R"(error Movanta -\[SLAppMigrator performMigration\]: )"
+                                          R"(SLAppMigrator: Not removing .*)")));
+    EXPECT_EQ(r.err.find("notice"), std::string::npos);
+    expectNoEscapes(r);
+  }
+  {
+    SCOPED_TRACE("nothing to migrate, human summary, --log-level error keeps notices out of stderr");
+    TempDir root(TempDir::kShm);
+    const ProgramResult r = stowline({"migrate", "--root", root.path(), "--log-level", "error", "--no-progress"});
+    EXPECT_EQ(r.status, 0) << r.err;
+    EXPECT_NE(r.out.find("0 items to migrate"), std::string::npos) << r.out;
+    EXPECT_NE(r.out.find("Migrated 0 of 0 items in "), std::string::npos) << r.out;
+    EXPECT_EQ(r.err.find("notice"), std::string::npos) << r.err;
+  }
+}
+
+TEST(MigrateTest, UsageErrorsChangeNothing) {
+  TempDir root(TempDir::kShm);
+  makeOldLayout(root.path());
+  const std::string before = listing(root.path());
+  struct Case {
+    std::vector<std::string> args;
+    std::string message;  // in the first line of standard error
+    bool oneLine;         // no hint at --help follows
+  };
+  const std::string file = root.path() + kOldRoot + "/C/A.app/Exec";
+  const std::vector<Case> cases = {
+      {{"--bogus"}, "unknown option '--bogus'", false},
+      {{"--root"}, "option --root needs a value", false},
+      {{"--log-format", "xml"}, "unknown log format 'xml'", false},
+      {{"--root", root / "missing"}, "does not exist", false},
+      {{"--root", file}, "is not a directory", false},
+      {{"--plugin", root / "missing.so"}, "cannot load the plug-in: ", true},
+      {{"--plugin", SL_NOT_A_PLUGIN_PATH}, "not a migration plug-in: ", true},
+      {{"--log-file", root / "missing/dir/log"}, "cannot open log file ", true},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.message);
+    std::vector<std::string> args{"migrate"};
+    if (c.args.front() != "--root") args.insert(args.end(), {"--root", root.path()});
+    args.insert(args.end(), c.args.begin(), c.args.end());
+    const ProgramResult r = stowline(args);
+    EXPECT_EQ(r.status, 2);
+    EXPECT_EQ(r.out, "");
+    EXPECT_TRUE(r.err.starts_with("stowline migrate: ")) << r.err;
+    EXPECT_NE(r.err.substr(0, r.err.find('\n')).find(c.message), std::string::npos) << r.err;
+    if (c.oneLine) {
+      EXPECT_EQ(lineCount(r.err), 1u) << r.err;
+    }
+    EXPECT_EQ(listing(root.path()), before);
+  }
+}
+
+TEST(MigrateTest, DigestAndConfig) {
+  TempDir dir(TempDir::kShm);
+  sl::test::writeFile(dir / "a", "alpha");
+  sl::test::writeFile(dir / "b", std::string(70000, 'b'));  // more than one chunk
+  const ProgramResult expected = runProgram({"/usr/bin/sha256sum", dir / "a", dir / "b"});
+  ASSERT_EQ(expected.status, 0);
+  const ProgramResult r = stowline({"digest", dir / "a", dir / "missing", dir / "b"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.out, expected.out);
+  EXPECT_EQ(r.err, "stowline digest: failed to open " + (dir / "missing") + " : No such file or directory\n");
+
+  const std::string data = dir.path() + "/private/var/stowd/Library/Stowline";
+  const ProgramResult text = stowline({"config", "--root", dir.path()});
+  EXPECT_EQ(text.status, 0) << text.err;
+  EXPECT_TRUE(hasLine(text.out, std::regex("  dataDirectory +" + data))) << text.out;
+  const ProgramResult json = stowline({"config", "--root", dir.path(), "--json"});
+  EXPECT_NE(json.out.find("\"dataDirectory\":\"" + data + "\""), std::string::npos) << json.out;
+}
+
+// The installed program runs from its own directories and loads the plug-in
+// installed beside it.
+TEST(MigrateTest, InstalledProgramFindsItsPlugIn) {
+  TempDir prefix(TempDir::kShm);
+  const ProgramResult install =
+      runProgram({SL_CMAKE_COMMAND, "--install", SL_BINARY_DIR, "--prefix", prefix.path()});
+  ASSERT_EQ(install.status, 0) << install.out << install.err;
+  const std::string lib = prefix / SL_INSTALL_LIBDIR;
+  for (const std::string& path :
+       {prefix / "bin/stowline", lib + "/libsl_platform.so", lib + "/libsl_host.so",
+        lib + "/stowline/libstowline-appmigrator.so", prefix / "include/stowline/Platform/Value.h",
+        prefix / "include/stowline/AppMigrator/AppMigrator.h", prefix / "share/man/man1/stowline.1"})
+    EXPECT_TRUE(sl::test::exists(path)) << path;
+
+  const ProgramResult version = runProgram({prefix / "bin/stowline", "--version"});
+  EXPECT_EQ(version.status, 0) << version.err;
+  EXPECT_TRUE(version.out.starts_with("stowline ")) << version.out;
+
+  TempDir root(TempDir::kShm);
+  makeOldLayout(root.path());
+  const ProgramResult r = runProgram({prefix / "bin/stowline", "migrate", "--root", root.path()});
+  EXPECT_EQ(r.status, 0) << r.err;
+  EXPECT_NE(r.out.find("Plug-in: " + prefix.path() + "/bin/../" SL_INSTALL_LIBDIR "/stowline/libstowline-appmigrator.so\n"),
+            std::string::npos)
+      << r.out;
+}
+
+}  // namespace
