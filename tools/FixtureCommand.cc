@@ -166,6 +166,7 @@ class FixtureWriter {
   bool writeApplication(const Directory& root, uint64_t index);
   bool writeVPNContainer(const Directory& root, uint64_t index);
   bool writeHarbors();
+  bool writeSystemVersion();
   bool writeMaps();
 
   const Options& options_;
@@ -458,6 +459,21 @@ bool FixtureWriter::writeMaps() {
   return true;
 }
 
+// The system-version source of the sample system, unless the root already
+// has one: a migration records the build it ran for.
+bool FixtureWriter::writeSystemVersion() {
+  Directory etc;
+  if (!openPath(sl::pathBelowSystemRoot("/etc"), &etc)) return false;
+  struct stat st;
+  if (::fstatat(etc.fd.get(), "os-release", &st, AT_SYMLINK_NOFOLLOW) != 0) {
+    if (!writeFile(etc, "os-release", bytesOf("NAME=\"Stowline Sample\"\nVERSION_ID=\"1.0\"\nBUILD_ID=\"S1000\"\n"), 0644)) {
+      return false;
+    }
+  }
+  finishLater_.push_back(std::move(etc));
+  return true;
+}
+
 int FixtureWriter::run() {
   ::umask(022);  // the modes asked for are the modes written
   if (!makeIcon()) return 1;
@@ -484,7 +500,7 @@ int FixtureWriter::run() {
   }
   finishLater_.push_back(std::move(root));
 
-  if (!writeHarbors() || !writeMaps()) return 1;
+  if (!writeHarbors() || !writeMaps() || !writeSystemVersion()) return 1;
   for (Directory& directory : finishLater_) {
     if (!finish(directory)) return 1;
   }

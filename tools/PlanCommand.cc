@@ -418,6 +418,14 @@ std::string joined(const std::vector<std::string>& parts) {
   return out;
 }
 
+// The names of entries of one container, for the text form (JSON keeps the
+// whole paths).
+std::vector<std::string> names(const std::vector<std::string>& paths) {
+  std::vector<std::string> out;
+  for (const std::string& path : paths) out.push_back(sl::URL::fileURLWithPath(path, false).lastPathComponent());
+  return out;
+}
+
 }  // namespace
 
 int planCommand(Arguments args) {
@@ -596,13 +604,13 @@ int planCommand(Arguments args) {
       std::printf("  second bundle: %s\n", second.c_str());
     }
     std::printf("  registry knows: %s\n", item.registryType ? ("yes (" + *item.registryType + ")").c_str() : "no");
-    std::printf("  data items: %s\n", joined(item.dataItems).c_str());
+    std::printf("  data items: %s\n", joined(names(item.dataItems)).c_str());
     std::vector<std::string> groups;
     for (const GroupMove& group : item.groups) {
       groups.push_back(group.group + " from " + group.path + (group.exists ? "" : " (missing)"));
     }
     std::printf("  group containers: %s\n", joined(groups).c_str());
-    std::printf("  leftovers: %s\n", item.listed ? joined(item.leftovers).c_str() : "container cannot be listed");
+    std::printf("  leftovers: %s\n", item.listed ? joined(names(item.leftovers)).c_str() : "container cannot be listed");
   }
   std::printf("\nSafe harbor map: %s (%s)\n", harborMapURL.path().c_str(),
               !harborMapPresent   ? "absent"
