@@ -10,6 +10,7 @@
 
 #include <cstdint>
 
+#include "AppMigrator/OldLayout.h"
 #include "AppMigrator/AppMigrator.h"
 #include "FileManager/SLFileManager.h"
 #include "Platform/ApplicationRegistry.h"
@@ -18,8 +19,8 @@ namespace {
 
 constexpr char kFunctionName[] =
     "-[SLAppMigrator _stageAndInstallBundleAtURL:withIdentifier:andVPNPluginAtURL:inContainerURL:]";
-constexpr char kStagingDirectoryName[] = "Staging";
-constexpr char kPayloadDirectoryName[] = "Payload";
+using sl::migrator::kStagingDirectoryName;
+using sl::migrator::kPayloadDirectoryName;
 constexpr uint64_t kMigratorInstallType = 6;
 
 }  // namespace

@@ -14,24 +14,12 @@
 #include <string_view>
 #include <vector>
 
+#include "AppMigrator/OldLayout.h"
 #include "Platform/Error.h"
 #include "Platform/URL.h"
 #include "Platform/Value.h"
 
 namespace sl::migrator {
-
-inline constexpr char kContainerPathKey[] = "ContainerPath";
-inline constexpr char kBundlePathKey[] = "BundlePath";
-inline constexpr char kContainerTypeKey[] = "ContainerType";
-inline constexpr char kBundleIdentifierKey[] = "BundleIdentifier";
-inline constexpr char kSecondBundlePathKey[] = "SecondBundlePath";
-inline constexpr char kContainerTypeApp[] = "App";
-inline constexpr char kContainerTypeVPNBundle[] = "VPNBundle";
-
-// The marker family: file names directly inside an old container.
-inline constexpr char kMigrationMarkerName[] = "com.vantor.stowline.container_migrator.plist";
-inline constexpr char kMigrationMarkerFlagName[] = "com.vantor.stowline.migration_marker";
-inline constexpr char kPlaceholderFlagName[] = "com.vantor.stowline.placeholder";
 
 // The functions under which the migrator logs the lines made here.
 inline constexpr char kIntrospectFunctionName[] = "-[SLAppMigrator _introspectContainer:orderResultEarly:]";

@@ -16,6 +16,7 @@
 #include <string_view>
 #include <vector>
 
+#include "AppMigrator/OldLayout.h"
 #include "AppMigrator/AppMigrator.h"
 #include "FileManager/SLFileManager.h"
 #include "Platform/ApplicationRegistry.h"
@@ -23,16 +24,16 @@
 
 namespace {
 
-constexpr char kContainerPathKey[] = "ContainerPath";
-constexpr char kBundlePathKey[] = "BundlePath";
-constexpr char kSecondBundlePathKey[] = "SecondBundlePath";
-constexpr char kBundleIdentifierKey[] = "BundleIdentifier";
-constexpr char kContainerTypeKey[] = "ContainerType";
-constexpr char kContainerTypeApp[] = "App";
+using sl::migrator::kContainerPathKey;
+using sl::migrator::kBundlePathKey;
+using sl::migrator::kSecondBundlePathKey;
+using sl::migrator::kBundleIdentifierKey;
+using sl::migrator::kContainerTypeKey;
+using sl::migrator::kContainerTypeApp;
 
 // The marker this system writes, and the two older marker names that are
 // never read but are not leftovers either.
-constexpr char kMigrationMarkerName[] = "com.vantor.stowline.container_migrator.plist";
+using sl::migrator::kMigrationMarkerName;
 constexpr std::string_view kMarkerFamilyNames[] = {
     kMigrationMarkerName,
     "com.vantor.stowline.migration_marker",

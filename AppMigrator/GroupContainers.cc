@@ -11,6 +11,7 @@
 #include <string>
 #include <vector>
 
+#include "AppMigrator/OldLayout.h"
 #include "AppMigrator/AppMigrator.h"
 #include "FileManager/SLFileManager.h"
 #include "Platform/ApplicationRegistry.h"
@@ -19,7 +20,7 @@ namespace {
 
 constexpr char kMigrateGroupsFunctionName[] = "-[SLAppMigrator _migrateGroupContainersForIdentifier:]";
 constexpr char kMoveItemsFunctionName[] = "-[SLAppMigrator _moveAllItemsInGroupContainerURL:toGroupContainerURL:]";
-constexpr char kGroupContainerPathKey[] = "Container";
+using sl::migrator::kGroupContainerPathKey;
 
 }  // namespace
 

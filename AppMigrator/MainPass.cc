@@ -5,6 +5,7 @@
 #include <optional>
 #include <vector>
 
+#include "AppMigrator/OldLayout.h"
 #include "AppMigrator/AppMigrator.h"
 #include "Configuration/SLGlobalConfiguration.h"
 #include "FileManager/SLFileManager.h"
@@ -14,8 +15,8 @@
 
 namespace {
 
-constexpr char kWhereDidMyApplicationsGoFileName[] = "WhereDidMyApplicationsGo.txt";
-constexpr char kVersionFileName[] = "AppMigratorLastSystemVersion.plist";
+constexpr const char* kWhereDidMyApplicationsGoFileName = sl::migrator::kWhereDidMyApplicationsGoName;
+constexpr const char* kVersionFileName = sl::migrator::kLastSystemVersionFileName;
 
 }  // namespace
 
@@ -60,8 +61,8 @@ bool SLAppMigrator::performMigration() {
 
     // Migration: each record counts once, whatever its outcome.
     for (const sl::Dictionary& record : records) {
-      const sl::Value identifier = record.get("BundleIdentifier");
-      const sl::Value bundlePath = record.get("BundlePath");
+      const sl::Value identifier = record.get(sl::migrator::kBundleIdentifierKey);
+      const sl::Value bundlePath = record.get(sl::migrator::kBundlePathKey);
       SLMigratorLog(sl::kLogLevelNotice, kFunctionName, "SLAppMigrator: Migrating %@ at %@", identifier, bundlePath);
       if (!_migrateContainerWithInfo(record)) {
         SLMigratorLog(sl::kLogLevelError, kFunctionName, "SLAppMigrator: Migration of %@ at %@ failed", identifier,

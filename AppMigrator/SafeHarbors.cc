@@ -1,6 +1,7 @@
 // SLAppMigrator: registering the installer's safe harbors with the
 // installer library, and retiring the safe harbor map once all of them are.
 
+#include "AppMigrator/OldLayout.h"
 #include "AppMigrator/AppMigrator.h"
 #include "Configuration/SLGlobalConfiguration.h"
 #include "FileManager/SLFileManager.h"
@@ -8,8 +9,8 @@
 
 namespace {
 
-constexpr char kSafeHarborMapName[] = "SafeHarbor.plist";
-constexpr char kHarborPathKey[] = "HarborPathKey";
+using sl::migrator::kSafeHarborMapName;
+using sl::migrator::kHarborPathKey;
 // The container type every harbor is registered with.
 constexpr int kSafeHarborContainerType = 2;
 

@@ -5,6 +5,7 @@
 #include <memory>
 #include <utility>
 
+#include "AppMigrator/OldLayout.h"
 #include "AppMigrator/AppMigrator.h"
 #include "Configuration/SLGlobalConfiguration.h"
 #include "FileManager/SLFileManager.h"
@@ -13,8 +14,8 @@
 
 namespace {
 
-constexpr char kHarborMapFileName[] = "SafeHarbor.plist";
-constexpr char kVersionFileName[] = "AppMigratorLastSystemVersion.plist";
+constexpr const char* kHarborMapFileName = sl::migrator::kSafeHarborMapName;
+constexpr const char* kVersionFileName = sl::migrator::kLastSystemVersionFileName;
 
 }  // namespace
 
@@ -60,7 +61,7 @@ bool SLAppMigrator::init() {
       } else {
         // A copy of the handle: changes made through it leave _installMap as
         // it was read.
-        sl::Dictionary groupContainers = _installMap.get("GroupContainers").asDictionary();
+        sl::Dictionary groupContainers = _installMap.get(sl::migrator::kGroupContainersKey).asDictionary();
         if (groupContainers.isNull()) {
           SLMigratorLog(sl::kLogLevelNotice, kFunctionName,
                         "SLAppMigrator: No group container map found in install map");

@@ -25,6 +25,7 @@
 #include <string_view>
 #include <vector>
 
+#include "AppMigrator/OldLayout.h"
 #include "Configuration/SLGlobalConfiguration.h"
 #include "Platform/Icon.h"
 #include "Platform/ImageDestination.h"
@@ -65,11 +66,11 @@ constexpr char kUsage[] =
 // 00:00:00 UTC.
 constexpr time_t kFixtureTime = 1609459200;
 
-constexpr char kGroupContainersKey[] = "GroupContainers";
-constexpr char kGroupContainerPathKey[] = "Container";
-constexpr char kHarborMapName[] = "SafeHarbor.plist";
-constexpr char kHarborPathKey[] = "HarborPathKey";
-constexpr char kOldRootNoteName[] = "WhereDidMyApplicationsGo.txt";
+using sl::migrator::kGroupContainersKey;
+using sl::migrator::kGroupContainerPathKey;
+constexpr const char* kHarborMapName = sl::migrator::kSafeHarborMapName;
+using sl::migrator::kHarborPathKey;
+constexpr const char* kOldRootNoteName = sl::migrator::kWhereDidMyApplicationsGoName;
 constexpr char kOldGroupsDirectory[] = "/private/var/mobile/Containers/OldGroups";
 constexpr char kHarborsDirectory[] = "/private/var/stowd/Library/SafeHarbors";
 

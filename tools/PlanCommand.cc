@@ -25,6 +25,7 @@
 #include <string>
 #include <vector>
 
+#include "AppMigrator/OldLayout.h"
 #include "AppMigrator/Classification.h"
 #include "Configuration/SLGlobalConfiguration.h"
 #include "FileManager/SLFileManager.h"
@@ -56,9 +57,9 @@ constexpr char kUsage[] =
     "  --json      one JSON object instead of text\n"
     "  --help      this text\n";
 
-constexpr char kWhereDidMyApplicationsGo[] = "WhereDidMyApplicationsGo.txt";
-constexpr char kSafeHarborFileName[] = "SafeHarbor.plist";
-constexpr char kStagingName[] = "Staging";
+constexpr const char* kWhereDidMyApplicationsGo = sl::migrator::kWhereDidMyApplicationsGoName;
+constexpr const char* kSafeHarborFileName = sl::migrator::kSafeHarborMapName;
+constexpr const char* kStagingName = sl::migrator::kStagingDirectoryName;
 
 // ---- The registry's database, read without touching it ----
 
@@ -268,7 +269,7 @@ class Planner {
         registry_(registryDatabasePath()) {
     const sl::Dictionary installMap = sl::dictionaryWithContentsOfURL(configuration_.oldInstallMapPath());
     installMapRead_ = !installMap.isNull();
-    groupMap_ = installMap.get("GroupContainers").asDictionary();
+    groupMap_ = installMap.get(sl::migrator::kGroupContainersKey).asDictionary();
   }
 
   // The database below the installer base: INSTALLER_BASE/Library/Registry.
@@ -389,7 +390,7 @@ std::vector<Harbor> readHarbors(const sl::URL& mapURL, bool* present, bool* read
   *readable = !map.isNull();
   if (map.isNull()) return harbors;
   for (const auto& [identifier, entry] : map) {
-    const sl::String path = entry.asDictionary().get("HarborPathKey").asString();
+    const sl::String path = entry.asDictionary().get(sl::migrator::kHarborPathKey).asString();
     harbors.push_back({identifier, path.isNull() ? std::nullopt : std::optional<std::string>(path.str())});
   }
   return harbors;

@@ -13,6 +13,7 @@
 #include <string_view>
 #include <vector>
 
+#include "AppMigrator/OldLayout.h"
 #include "Configuration/SLGlobalConfiguration.h"
 #include "FileManager/SLFileManager.h"
 #include "Platform/ApplicationRegistry.h"
@@ -183,7 +184,7 @@ sl::URL packageBundle(const sl::URL& package, bool placeholder) {
   if (placeholder) return package;
   sl::Error error;
   const std::optional<std::vector<sl::URL>> items = SLFileManager::defaultManager().urlsForItemsInDirectoryAtURL(
-      package.URLByAppendingPathComponent("Payload", true), true, &error);
+      package.URLByAppendingPathComponent(sl::migrator::kPayloadDirectoryName, true), true, &error);
   if (!items) {
     setupError(kCommand, "cannot list " + package.path() + "/Payload: " + describe(error));
     return nullptr;
