@@ -139,14 +139,27 @@ void EmbeddedRegistry::setCrashStepForTesting(int k) { gCrashStep.store(k); }
 EmbeddedRegistry::EmbeddedRegistry(SLGlobalConfiguration& configuration, rg::Database db)
     : configuration_(configuration), db_(std::move(db)) {}
 
+namespace {
+// The configuration's data directory is INSTALLER_BASE/Library/Stowline: the
+// installer base is two levels up.
+sl::URL installerBaseOf(SLGlobalConfiguration& configuration) {
+  return configuration.dataDirectoryPath().URLByDeletingLastPathComponent().URLByDeletingLastPathComponent();
+}
+constexpr char kRegistryDirectory[] = "/Library/Registry";
+constexpr char kDatabaseName[] = "registry.sqlite";
+}  // namespace
+
+std::string EmbeddedRegistry::databasePathFor(SLGlobalConfiguration& configuration) {
+  return installerBaseOf(configuration).path() + kRegistryDirectory + "/" + kDatabaseName;
+}
+
 std::shared_ptr<EmbeddedRegistry> EmbeddedRegistry::open(SLGlobalConfiguration& configuration, sl::Error* error) {
   static constexpr char kFunctionName[] = "+[EmbeddedRegistry open:error:]";
-  // The configuration's data directory is INSTALLER_BASE/Library/Stowline and
-  // its old container root USER_BASE/Applications: the bases come from there.
-  const sl::URL installerBase =
-      configuration.dataDirectoryPath().URLByDeletingLastPathComponent().URLByDeletingLastPathComponent();
+  // The bases come from the configuration: the installer base above its
+  // data directory, the user base above the old container root.
+  const sl::URL installerBase = installerBaseOf(configuration);
   const std::string userBase = parentPath(configuration.oldContainerPath());
-  const std::string registryDirectory = installerBase.path() + "/Library/Registry";
+  const std::string registryDirectory = installerBase.path() + kRegistryDirectory;
   const std::string bundleRoot = installerBase.path() + "/Containers/Bundle";
   const std::string dataRoot = userBase + "/Containers/Data";
   const std::string groupRoot = userBase + "/Containers/Shared";
@@ -155,7 +168,7 @@ std::shared_ptr<EmbeddedRegistry> EmbeddedRegistry::open(SLGlobalConfiguration& 
   for (const std::string& directory : {registryDirectory, bundleRoot, dataRoot, groupRoot}) {
     if (!fm.createDirectoryAtURL(sl::URL::fileURLWithPath(directory, true), true, 0755, error)) return nullptr;
   }
-  const std::string databasePath = registryDirectory + "/registry.sqlite";
+  const std::string databasePath = databasePathFor(configuration);
   std::optional<rg::Database> db = rg::Database::open(databasePath, error);
   if (!db) return nullptr;
 

@@ -74,6 +74,9 @@ class EmbeddedRegistry : public RGApplicationWorkspace,
   // failure.
   static std::shared_ptr<EmbeddedRegistry> open(SLGlobalConfiguration& configuration, sl::Error* error);
 
+  // Where the database of that layout lives; computes only, creates nothing.
+  static std::string databasePathFor(SLGlobalConfiguration& configuration);
+
   // ---- RGApplicationWorkspace ----
   bool applicationIsInstalled(const sl::String& identifier) override;
   bool installApplication(const sl::URL& path, const sl::Dictionary& withOptions, sl::Error* error,

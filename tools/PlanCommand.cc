@@ -34,6 +34,7 @@
 #include "Platform/PropertyList.h"
 #include "Platform/SystemRoot.h"
 #include "Platform/UniqueFd.h"
+#include "Registry/EmbeddedRegistry.h"
 #include "tools/Commands.h"
 #include "tools/Json.h"
 
@@ -272,12 +273,7 @@ class Planner {
     groupMap_ = installMap.get(sl::migrator::kGroupContainersKey).asDictionary();
   }
 
-  // The database below the installer base: INSTALLER_BASE/Library/Registry.
-  std::string registryDatabasePath() {
-    const sl::URL installerBase =
-        configuration_.dataDirectoryPath().URLByDeletingLastPathComponent().URLByDeletingLastPathComponent();
-    return installerBase.path() + "/Library/Registry/registry.sqlite";
-  }
+  std::string registryDatabasePath() { return EmbeddedRegistry::databasePathFor(configuration_); }
 
   Item plan(const sl::URL& url) {
     Item item;
