@@ -29,8 +29,6 @@ std::vector<std::string> names(const std::string& dir) {
   return out;
 }
 
-bool startsWith(const std::string& text, const std::string& prefix) { return text.rfind(prefix, 0) == 0; }
-
 // Forwards to the registry and keeps what the last install call was handed:
 // the options and the names in the package and in its Payload.
 struct RecordingWorkspace : RGApplicationWorkspace {
@@ -59,9 +57,7 @@ class InstallationTest : public mgtest::MigratorTest {
     recorder_ = std::make_shared<RecordingWorkspace>(registry_);
     RGApplicationWorkspace::setDefaultWorkspace(recorder_);
   }
-  static std::string url(const std::string& path, bool directory = true) {
-    return fileURL(path, directory).absoluteString();
-  }
+  static std::string url(const std::string& path, bool directory = true) { return mgtest::u(path, directory); }
   std::vector<LogCapture::Line> lines() { return log_.host(); }
   static LogCapture::Line line(int level, const char* function, const std::string& message) {
     return {level, "Movanta", function, "SLAppMigrator: " + message};
@@ -105,23 +101,14 @@ TEST_F(InstallationTest, StagesAndInstallsBundles) {
     EXPECT_TRUE(lines().empty());
   }
 
-  // A built-in application at least as new: one notice, and success.
+  // A refusal other than a built-in application's: the handler's line, then
+  // the failure with the record.
   const std::string bundle = c_ + "/A.app";
   const auto stage = [&](const char* id) {
     return Access::stageAndInstall(*migrator_, fileURL(bundle, true), id, nullptr, fileURL(c_, true));
   };
   fresh();
-  builtIn("com.ex.a", "9.0");
-  mgtest::makeBundle(bundle, "com.ex.a");
-  EXPECT_TRUE(stage("com.ex.a"));
-  EXPECT_EQ(lines(), (std::vector{line(5, kStage,
-                                       "Installation of " + url(bundle) +
-                                           " failed because it's older than what's built into the "
-                                           "system. Data migration already happened so we're done here.")}));
-
-  // Any other refusal: the handler's line, then the failure with the record.
   mgtest::makeBundle(bundle, "com.ex.b");
-  log_.clear();
   EXPECT_FALSE(stage("com.ex.c"));
   ASSERT_EQ(lines().size(), 2u);
   EXPECT_EQ(lines()[0], line(3, kStage,
@@ -129,7 +116,7 @@ TEST_F(InstallationTest, StagesAndInstallsBundles) {
                                  " failed with Stowline error Package identifier com.ex.b does not match "
                                  "the option com.ex.c (IdentifierMismatch : " +
                                  c_ + "/Staging)"));
-  EXPECT_TRUE(startsWith(lines()[1].message, "SLAppMigrator: Failed to install " + url(c_ + "/Staging") +
+  EXPECT_TRUE(lines()[1].message.starts_with("SLAppMigrator: Failed to install " + url(c_ + "/Staging") +
                                                  " : Error Domain=RGErrorDomain Code=4 "));
 
   // The payload directory cannot be made: the bundle stays where it was.
@@ -142,7 +129,7 @@ TEST_F(InstallationTest, StagesAndInstallsBundles) {
     EXPECT_FALSE(stage("com.ex.b"));
   }
   ASSERT_EQ(lines().size(), 1u);
-  EXPECT_TRUE(startsWith(lines()[0].message, "SLAppMigrator: Failed to create " + url(c_ + "/Staging/Payload")));
+  EXPECT_TRUE(lines()[0].message.starts_with("SLAppMigrator: Failed to create " + url(c_ + "/Staging/Payload")));
   EXPECT_TRUE(exists(bundle + "/Info.plist"));
 }
 
@@ -168,19 +155,25 @@ TEST_F(InstallationTest, InstallsPlaceholders) {
   const auto install = [&] {
     return Access::installPlaceholder(*migrator_, fileURL(bundle, true), "com.ex.p", fileURL(c_, true));
   };
-  const sl::Dictionary options{{"InstallType", sl::Number(6)},
-                               {"PackageType", sl::String("Placeholder")},
-                               {"SkipBlacklist", sl::Boolean(true)},
-                               {"PBBundleIdentifier", sl::String("com.ex.p")}};
+  const auto options = [](bool metadata) {
+    sl::Dictionary o{{"InstallType", sl::Number(6)},
+                     {"PackageType", sl::String("Placeholder")},
+                     {"SkipBlacklist", sl::Boolean(true)},
+                     {"PBBundleIdentifier", sl::String("com.ex.p")}};
+    if (metadata) o.set(RGJukoraMetadataKey, sl::Data(std::string_view("meta")));
+    return o;
+  };
   const auto installing = line(5, kPlaceholder, "Installing placeholder for com.ex.p");
 
   // The icon is written when the renderer gives one; without it, two lines.
+  // Readable store metadata travels as bytes, without a line.
   for (const bool icon : {true, false}) {
-    SCOPED_TRACE(icon ? "with an icon" : "without an icon");
+    SCOPED_TRACE(icon ? "with an icon and metadata" : "without an icon or metadata");
     fresh();
     makePlaceholderSource(bundle, icon);
+    if (icon) sl::test::writeFile(c_ + "/JukoraMetadata.plist", "meta");
     ASSERT_TRUE(install());
-    EXPECT_EQ(recorder_->options, options);  // no store metadata, no line about it
+    EXPECT_EQ(recorder_->options, options(icon));
     const std::string installed = RGBundleProxy::bundleProxyForIdentifier("com.ex.p")->bundleURL().path();
     sl::Dictionary expected{{"PBBundleIdentifier", sl::String("com.ex.p")},
                             {"PBBundleExecutable", sl::String("Exec")},
@@ -198,22 +191,16 @@ TEST_F(InstallationTest, InstallsPlaceholders) {
     EXPECT_FALSE(exists(staged));
   }
 
-  // Store metadata that cannot be read: logged, installed without; readable
-  // metadata travels as bytes.
+  // Store metadata that cannot be read: logged, installed without.
   fresh();
   makePlaceholderSource(bundle, true);
   sl::test::makeDirs(c_ + "/JukoraMetadata.plist");
   ASSERT_TRUE(install());
-  EXPECT_EQ(recorder_->options, options);
+  EXPECT_EQ(recorder_->options, options(false));
   ASSERT_EQ(lines().size(), 2u);
-  EXPECT_TRUE(startsWith(lines()[0].message, "SLAppMigrator: Failed to read " +
+  EXPECT_TRUE(lines()[0].message.starts_with("SLAppMigrator: Failed to read " +
                                                  url(c_ + "/JukoraMetadata.plist", false) +
                                                  " : Error Domain=FileErrorDomain Code=256 "));
-  fresh();
-  makePlaceholderSource(bundle, true);
-  sl::test::writeFile(c_ + "/JukoraMetadata.plist", "meta");
-  ASSERT_TRUE(install());
-  EXPECT_EQ(recorder_->options.get(RGJukoraMetadataKey), sl::Data(std::string_view("meta")));
 
   // The registry refuses (never over a built-in application): the record's
   // user-info is logged, the staged directory goes.
@@ -222,7 +209,7 @@ TEST_F(InstallationTest, InstallsPlaceholders) {
   makePlaceholderSource(bundle, true);
   EXPECT_FALSE(install());
   ASSERT_EQ(lines().size(), 2u);
-  EXPECT_TRUE(startsWith(lines()[1].message, "SLAppMigrator: Failed to install placeholder for com.ex.p: {"));
+  EXPECT_TRUE(lines()[1].message.starts_with("SLAppMigrator: Failed to install placeholder for com.ex.p: {"));
   EXPECT_NE(lines()[1].message.find("never installed over the built-in application com.ex.p"), std::string::npos);
   EXPECT_FALSE(exists(staged));
 
@@ -244,16 +231,6 @@ TEST_F(InstallationTest, InstallsPlaceholders) {
   EXPECT_FALSE(exists(staged));
 }
 
-// A customer install of an application that belongs to `groups`.
-void installApp(EmbeddedRegistry& registry, const std::string& id, const std::vector<std::string>& groups) {
-  const std::string package = below("/private/var/packages/" + id);
-  mgtest::makeBundle(package + "/Payload/X.app", id, "1.0", groups);
-  ASSERT_TRUE(registry.installApplication(fileURL(package, true),
-                                          sl::Dictionary{{RGPackageTypeKey, sl::String(RGPackageTypeCustomer)},
-                                                         {RGBundleIdentifierOptionKey, sl::String(id)}},
-                                          nullptr));
-}
-
 std::string groupPath(const std::string& id, const std::string& group) {
   return RGBundleProxy::bundleProxyForIdentifier(id)->groupContainerURLs().get(group).asURL().path();
 }
@@ -266,9 +243,9 @@ TEST_F(InstallationTest, MigratesGroupContainers) {
   EXPECT_TRUE(Access::migrateGroups(*migrator_, "com.ex.unknown"));
   EXPECT_TRUE(lines().empty());
 
-  installApp(*registry_, "com.ex.a", {"group.new", "group.shared"});
-  installApp(*registry_, "com.ex.b", {"group.shared"});
-  installApp(*registry_, "com.ex.c", {"group.empty", "group.gone"});
+  mgtest::installInRegistry(*registry_, "com.ex.a", RGPackageTypeCustomer, {"group.new", "group.shared"});
+  mgtest::installInRegistry(*registry_, "com.ex.b", RGPackageTypeCustomer, {"group.shared"});
+  mgtest::installInRegistry(*registry_, "com.ex.c", RGPackageTypeCustomer, {"group.empty", "group.gone"});
   const std::string old = below("/private/var/mobile/OldGroups"), shared = groupPath("com.ex.a", "group.shared");
   sl::test::writeFile(old + "/shared/file", "old");
   sl::test::writeFile(old + "/shared/sub/inner", "old");
@@ -323,7 +300,7 @@ TEST_F(InstallationTest, MigratesGroupContainers) {
     EXPECT_FALSE(Access::moveGroupItems(*migrator_, fileURL(old + "/partial", true), fileURL(old + "/into", true)));
   }
   ASSERT_EQ(lines().size(), 1u);
-  EXPECT_TRUE(startsWith(lines()[0].message, "SLAppMigrator: Failed to move item " + url(old + "/partial/two", false)));
+  EXPECT_TRUE(lines()[0].message.starts_with("SLAppMigrator: Failed to move item " + url(old + "/partial/two", false)));
   EXPECT_EQ(names(old + "/partial"), std::vector<std::string>{"two"});
 }
 

@@ -3,58 +3,47 @@
 #include <sys/stat.h>
 
 #include <algorithm>
-#include <memory>
-#include <string>
-#include <utility>
-#include <vector>
 
 #include "FileManager/SLFileManager.h"
 #include "MigratorTestSupport.h"
 
 namespace {
 
+using namespace mgtest;
 using sl::test::exists;
-using sl::test::fileURL;
-using Lines = std::vector<std::pair<int, std::string>>;
 constexpr int E = sl::kLogLevelError;
 constexpr int N = sl::kLogLevelNotice;
 const std::string kMarker = "com.vantor.stowline.container_migrator.plist";
 
-class IntrospectionTest : public mgtest::MigratorTest {
+class IntrospectionTest : public MigratorTest {
  protected:
   void SetUp() override {
     MigratorTest::SetUp();
     migrator_ = SLAppMigrator::create();  // before the old root exists: init leaves it alone
     ASSERT_TRUE(migrator_);
-    sl::test::makeDirs(mgtest::below(mgtest::kOldRoot));
+    sl::test::makeDirs(below(kOldRoot));
     log_.clear();
   }
-  static std::string entry(const std::string& name) { return mgtest::below(mgtest::kOldRoot) + "/" + name; }
-  static std::string u(const std::string& path, bool dir = false) { return fileURL(path, dir).absoluteString(); }
   sl::Dictionary introspect(const std::string& path, bool* early, bool dir = true) {
     return SLAppMigratorTestAccess::introspect(*migrator_, fileURL(path, dir), early);
   }
   Lines host() {
-    Lines out;
-    for (const auto& line : log_.host()) out.emplace_back(line.level, line.message);
+    Lines out = hostLines(log_);
     log_.clear();
     return out;
-  }
-  static void write(const std::string& path, const sl::Value& value) {
-    ASSERT_TRUE(sl::writePropertyListToURL(value, fileURL(path)));
   }
   std::unique_ptr<SLAppMigrator> migrator_;
 };
 
 TEST_F(IntrospectionTest, EntriesWithoutBundleAreRemovedOrIgnored) {
   bool early = false;
-  sl::test::writeFile(entry("stray"), "x");
-  EXPECT_TRUE(introspect(entry("stray"), &early, false).isNull());
-  EXPECT_FALSE(exists(entry("stray")));
-  EXPECT_EQ(host(), (Lines{{E, "SLAppMigrator: Found regular file at " + u(entry("stray")) + " ; removing"}}));
+  sl::test::writeFile(oldEntry("stray"), "x");
+  EXPECT_TRUE(introspect(oldEntry("stray"), &early, false).isNull());
+  EXPECT_FALSE(exists(oldEntry("stray")));
+  EXPECT_EQ(host(), (Lines{{E, "SLAppMigrator: Found regular file at " + u(oldEntry("stray")) + " ; removing"}}));
 
   // Data, and a bundle without identifier, which counts as no bundle.
-  const std::string c = entry("C");
+  const std::string c = oldEntry("C");
   for (const char* name : {"Documents/f", "Library", "tmp", "A.app"}) sl::test::makeDirs(c + "/" + name);
   EXPECT_TRUE(introspect(c, &early).isNull());
   EXPECT_FALSE(exists(c));
@@ -63,8 +52,8 @@ TEST_F(IntrospectionTest, EntriesWithoutBundleAreRemovedOrIgnored) {
                            {E, "SLAppMigrator: No app or vpn bundle found in container " + u(c, true) +
                                    " ; removing it"}}));
 
-  EXPECT_TRUE(introspect(entry("gone"), &early).isNull());
-  EXPECT_EQ(host(), (Lines{{N, "SLAppMigrator: Got ENOENT when introspecting " + u(entry("gone"), true) +
+  EXPECT_TRUE(introspect(oldEntry("gone"), &early).isNull());
+  EXPECT_EQ(host(), (Lines{{N, "SLAppMigrator: Got ENOENT when introspecting " + u(oldEntry("gone"), true) +
                                    " ; ignoring (likely raced with stowd)"}}));
 }
 
@@ -74,10 +63,10 @@ TEST_F(IntrospectionTest, EntriesWithoutBundleAreRemovedOrIgnored) {
 TEST_F(IntrospectionTest, AppWinsOverVPNPluginInEitherOrder) {
   for (const std::string name : {"AppFirst", "VPNFirst", "VPNOnly"}) {
     SCOPED_TRACE(name);
-    const std::string c = entry(name), app = c + "/A.app", vpn = c + "/P.vpnplugin";
-    if (name == "AppFirst") mgtest::makeBundle(app, "com.a");
-    mgtest::makeBundle(vpn, "com.p");
-    if (name == "VPNFirst") mgtest::makeBundle(app, "com.a");
+    const std::string c = oldEntry(name), app = c + "/A.app", vpn = c + "/P.vpnplugin";
+    if (name == "AppFirst") makeBundle(app, "com.a");
+    makeBundle(vpn, "com.p");
+    if (name == "VPNFirst") makeBundle(app, "com.a");
     const bool hasApp = name != "VPNOnly";
     bool early = !hasApp;
     sl::Dictionary expected{{"ContainerPath", sl::String(c)},
@@ -95,8 +84,8 @@ TEST_F(IntrospectionTest, AppWinsOverVPNPluginInEitherOrder) {
 }
 
 TEST_F(IntrospectionTest, LinksAndUnexaminableEntriesLeaveTheContainerInPlace) {
-  mgtest::makeBundle(mgtest::below("/Real.app"), "com.real");
-  const std::string app = entry("L1/A.app"), vpn = entry("L2/P.vpnplugin"), marker = entry("L3/" + kMarker);
+  makeBundle(below("/Real.app"), "com.real");
+  const std::string app = oldEntry("L1/A.app"), vpn = oldEntry("L2/P.vpnplugin"), marker = oldEntry("L3/" + kMarker);
   const std::pair<std::string, Lines> cases[] = {
       {app, {{E, "SLAppMigrator: Skipping container with app symlink at " + u(app)}}},
       {vpn,
@@ -110,7 +99,7 @@ TEST_F(IntrospectionTest, LinksAndUnexaminableEntriesLeaveTheContainerInPlace) {
     SCOPED_TRACE(link);
     const std::string c = link.substr(0, link.rfind('/'));
     sl::test::makeDirs(c);
-    sl::test::makeSymlink(mgtest::below("/Real.app"), link);
+    sl::test::makeSymlink(below("/Real.app"), link);
     bool early = false;
     EXPECT_TRUE(introspect(c, &early).isNull());
     EXPECT_TRUE(exists(link));
@@ -119,7 +108,7 @@ TEST_F(IntrospectionTest, LinksAndUnexaminableEntriesLeaveTheContainerInPlace) {
 
   // Not searchable: any name with a dot, even one without an extension, is
   // stat'ed and fails. Not readable: the listing fails.
-  const std::string closed = entry("Closed"), unreadable = entry("Unreadable");
+  const std::string closed = oldEntry("Closed"), unreadable = oldEntry("Unreadable");
   sl::test::writeFile(closed + "/.hidden");
   sl::test::makeDirs(unreadable);
   ASSERT_EQ(::chmod(closed.c_str(), 0744), 0);
@@ -136,58 +125,54 @@ TEST_F(IntrospectionTest, LinksAndUnexaminableEntriesLeaveTheContainerInPlace) {
 }
 
 TEST_F(IntrospectionTest, MarkerInContainer) {
-  // A valid marker is the record as it stands; the early flag follows its
-  // "ContainerType" alone.
+  // A valid marker (listed first: tmpfs lists by creation) is the record as
+  // it stands; the early flag follows its "ContainerType" alone.
   for (const std::string type : {"App", "VPNBundle", "Other"}) {
-    const std::string c = entry("M" + type);
-    mgtest::makeBundle(c + "/A.app", "com.a");
+    const std::string c = oldEntry("M" + type);
     sl::Dictionary marker{{"ContainerPath", sl::String("/else")}, {"BundlePath", sl::String("/else/B.app")},
                           {"ContainerType", sl::String(type)},   {"BundleIdentifier", sl::String("com.b")},
                           {"Extra", sl::Number(7)}};
-    write(c + "/" + kMarker, marker);
+    writePlist(c + "/" + kMarker, marker);
+    makeBundle(c + "/A.app", "com.a");
     bool early = type != "App";
     EXPECT_EQ(introspect(c, &early).description(), marker.description()) << type;
     EXPECT_EQ(early, type == "App") << type;
   }
 
-  // An invalid marker drops the record; a bundle keeps the container.
-  for (const bool withBundle : {true, false}) {
-    host();
-    const std::string c = entry(withBundle ? "BadWithApp" : "BadAlone");
-    sl::test::makeDirs(c);
-    if (withBundle) mgtest::makeBundle(c + "/A.app", "com.a");
-    write(c + "/" + kMarker, sl::Array{sl::String("not a dictionary")});
+  // An invalid marker drops the record, after the validation's own line; a
+  // bundle keeps the container.
+  auto changed = [](const char* key, const sl::Value& value) {  // a null value removes the key
+    sl::Dictionary d{{"ContainerPath", sl::String("/c")}, {"BundlePath", sl::String("/c/A.app")},
+                     {"ContainerType", sl::String("App")}, {"BundleIdentifier", sl::String("com.a")}};
+    if (key) d.set(key, value);
+    return d;
+  };
+  const struct {
+    const char* name;
+    sl::Value content;
+    std::string message;  // "" for the load failure itself
+  } cases[] = {
+      {"NotADictWithApp", sl::Array{changed(nullptr, nullptr)}, ""},
+      {"NotADictAlone", sl::Array{changed(nullptr, nullptr)}, ""},
+      {"NoBundlePathWithApp", changed("BundlePath", nullptr), "Failed to get bundle path from migration marker file "},
+      {"SecondNotAStringAlone", changed("SecondBundlePath", sl::Number(42)), "Second bundle path was not a string: 42"},
+  };
+  for (const auto& [name, content, message] : cases) {
+    SCOPED_TRACE(name);
+    const std::string c = oldEntry(name), marker = c + "/" + kMarker;
+    const bool withBundle = std::string(name).ends_with("WithApp");
+    writePlist(marker, content);
+    if (withBundle) makeBundle(c + "/A.app", "com.a");
     bool early = false;
     EXPECT_TRUE(introspect(c, &early).isNull());
     EXPECT_EQ(exists(c), withBundle);
     const Lines lines = host();
-    const std::pair failed{E, "SLAppMigrator: Failed to load migration marker file from " + u(c + "/" + kMarker)};
-    EXPECT_EQ(std::count(lines.begin(), lines.end(), failed), 2) << withBundle;
-  }
-}
-
-TEST_F(IntrospectionTest, MarkerValidation) {
-  const std::string path = entry(kMarker);
-  auto marker = [](std::initializer_list<std::pair<const std::string, sl::Value>> changes) {
-    sl::Dictionary d{{"ContainerPath", sl::String("/c")}, {"BundlePath", sl::String("/c/A.app")},
-                     {"ContainerType", sl::String("App")}, {"BundleIdentifier", sl::String("com.a")}};
-    for (const auto& [key, value] : changes) d.set(key, value);  // a null value removes the key
-    return d;
-  };
-  const std::pair<sl::Value, std::string> cases[] = {
-      {marker({}), ""},
-      {marker({{"ContainerType", sl::String("Other")}}), ""},
-      {marker({{"SecondBundlePath", sl::Number(42)}}), "Second bundle path was not a string: 42"},
-      {sl::Array{marker({})}, "Failed to load migration marker file from " + u(path)},
-      {marker({{"BundlePath", nullptr}, {"ContainerType", nullptr}}),
-       "Failed to get bundle path from migration marker file " + u(path)},
-  };
-  for (const auto& [content, message] : cases) {
-    SCOPED_TRACE(content.description());
-    write(path, content);
-    const sl::Dictionary loaded = SLAppMigratorTestAccess::loadMarker(*migrator_, fileURL(path));
-    EXPECT_EQ(loaded.description(), message.empty() ? content.description() : "(null)");
-    EXPECT_EQ(host(), (message.empty() ? Lines{} : Lines{{E, "SLAppMigrator: " + message}}));
+    const std::pair failed{E, "SLAppMigrator: Failed to load migration marker file from " + u(marker)};
+    EXPECT_EQ(std::count(lines.begin(), lines.end(), failed), message.empty() ? 2 : 1);
+    if (!message.empty()) {
+      const std::string own = "SLAppMigrator: " + message + (message.ends_with(' ') ? u(marker) : "");
+      EXPECT_EQ(std::count(lines.begin(), lines.end(), std::pair{E, own}), 1) << own;
+    }
   }
 }
 

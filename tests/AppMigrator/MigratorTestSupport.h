@@ -155,3 +155,44 @@ inline std::vector<std::string> hostMessages(const sl::test::LogCapture& log) {
 }
 
 }  // namespace mgtest
+
+namespace mgtest {
+
+// ROOT/private/var/mobile/Applications/NAME.
+inline std::string oldEntry(const std::string& name) { return below(kOldRoot) + "/" + name; }
+
+// The URL string of a path, as the log lines show it.
+inline std::string u(const std::string& path, bool directory = false) {
+  return fileURL(path, directory).absoluteString();
+}
+
+// The host log as (level, message) pairs, in order.
+using Lines = std::vector<std::pair<int, std::string>>;
+inline Lines hostLines(const sl::test::LogCapture& log) {
+  Lines out;
+  for (const auto& line : log.host()) out.emplace_back(line.level, line.message);
+  return out;
+}
+
+// A property list at path, its parent directories made.
+inline void writePlist(const std::string& path, const sl::Value& value) {
+  sl::test::makeDirs(path.substr(0, path.rfind('/')));
+  ASSERT_TRUE(sl::writePropertyListToURL(value, fileURL(path)));
+}
+
+// Installs X.app (identifier `id`, in `groups`) straight into the registry,
+// as an earlier run or the user would have: a placeholder is the bundle
+// itself, a customer package holds it in Payload.
+inline void installInRegistry(EmbeddedRegistry& registry, const std::string& id, const char* packageType,
+                              const std::vector<std::string>& groups = {}) {
+  const bool placeholder = std::string(packageType) == RGPackageTypePlaceholder;
+  const std::string package = below("/private/var/packages/" + id);
+  makeBundle(package + (placeholder ? "/X.app" : "/Payload/X.app"), id, "1.0", groups);
+  ASSERT_TRUE(registry.installApplication(fileURL(placeholder ? package + "/X.app" : package, true),
+                                          sl::Dictionary{{RGInstallTypeKey, sl::Number(6)},
+                                                         {RGPackageTypeKey, sl::String(packageType)},
+                                                         {RGBundleIdentifierOptionKey, sl::String(id)}},
+                                          nullptr));
+}
+
+}  // namespace mgtest

@@ -5,47 +5,31 @@
 #include <sys/stat.h>
 
 #include <algorithm>
-#include <memory>
-#include <string>
-#include <utility>
-#include <vector>
 
-#include "AppMigrator/AppMigrator.h"
 #include "FileManager/SLFileManager.h"
 #include "MigratorTestSupport.h"
 
 namespace {
 
-using mgtest::below;
+using namespace mgtest;
 using sl::test::exists;
-using sl::test::fileURL;
 using Access = SLAppMigratorTestAccess;
-using Line = std::pair<int, std::string>;
-using Lines = std::vector<Line>;
+using Line = Lines::value_type;
 constexpr int E = sl::kLogLevelError;
 constexpr int N = sl::kLogLevelNotice;
 const std::string kReturningFailed =
     "SLAppMigrator: Returning migration failed. Please include the contents of /var/mobile/Library/Logs/Stowline "
     "and /var/Mobile/Library/Logs/Movantis in a bug report.";
 
-class StartupAndMainPassTest : public mgtest::MigratorTest {
+class StartupAndMainPassTest : public MigratorTest {
  protected:
-  static std::string oldRoot() { return below(mgtest::kOldRoot); }
-  static std::string installMap() { return below(mgtest::kInstallMap); }
-  static std::string data(const std::string& name) { return below(mgtest::kDataDirectory) + "/" + name; }
-  static std::string u(const std::string& path, bool dir = false) { return fileURL(path, dir).absoluteString(); }
+  static std::string oldRoot() { return below(kOldRoot); }
+  static std::string installMap() { return below(kInstallMap); }
+  static std::string data(const std::string& name) { return below(kDataDirectory) + "/" + name; }
   static void writeOSRelease() {
     sl::test::writeFile(below("/etc/os-release"), "NAME=Testix\nVERSION_ID=9.1\nBUILD_ID=21A42\n");
   }
-  static void writePlist(const std::string& path, const sl::Value& value) {
-    sl::test::makeDirs(path.substr(0, path.rfind('/')));
-    ASSERT_TRUE(sl::writePropertyListToURL(value, fileURL(path)));
-  }
-  Lines host() const {
-    Lines out;
-    for (const auto& line : log_.host()) out.emplace_back(line.level, line.message);
-    return out;
-  }
+  Lines host() const { return hostLines(log_); }
   std::unique_ptr<SLAppMigrator> make() {
     std::unique_ptr<SLAppMigrator> migrator = SLAppMigrator::create();
     EXPECT_TRUE(migrator);
@@ -140,7 +124,7 @@ TEST_F(StartupAndMainPassTest, PassWithoutOldRoot) {
     SCOPED_TRACE(emptyRoot ? "empty root, deleted by init; no os-release" : "no root");
     sl::test::forceRemove(below("/etc"));
     emptyRoot ? sl::test::makeDirs(oldRoot()) : writeOSRelease();
-    mgtest::writeInstallMap({});
+    writeInstallMap({});
     writePlist(data("SafeHarbor.plist"), sl::Dictionary::create());
     log_.clear();
     auto m = make();
@@ -165,7 +149,7 @@ TEST_F(StartupAndMainPassTest, FinalCheckOfTheOldRoot) {
   {
     SCOPED_TRACE("only the note: deleted and counted, old layout removed");
     sl::test::writeFile(note, "gone");
-    mgtest::writeInstallMap({});
+    writeInstallMap({});
     auto m = make();
     EXPECT_TRUE(m->performMigration());
     EXPECT_EQ(Access::countItemsMigrated(*m), 1u);
@@ -200,10 +184,8 @@ TEST_F(StartupAndMainPassTest, FinalCheckOfTheOldRoot) {
 // follow in listing order. Their migration fails (the registry knows no
 // plug-in), the pass goes on, and the containers left fail the run.
 TEST_F(StartupAndMainPassTest, ApplicationRecordsAreMigratedFirst) {
-  for (const char* name : {"A", "B", "C"})
-    mgtest::makeBundle(oldRoot() + "/" + name + "/" + name + ".app", std::string("com.example.") + name);
-  for (const char* name : {"X", "Y"})
-    mgtest::makeBundle(oldRoot() + "/" + name + "/" + name + ".vpnplugin", std::string("com.example.") + name);
+  for (const std::string name : {"A", "B", "C", "X", "Y"})
+    makeBundle(oldRoot() + "/" + name + "/" + name + (name < "X" ? ".app" : ".vpnplugin"), "com.example." + name);
   auto m = make();
   std::vector<std::string> apps, plugins;
   for (const sl::URL& item : *Access::itemsToMigrate(*m)) {
@@ -217,23 +199,27 @@ TEST_F(StartupAndMainPassTest, ApplicationRecordsAreMigratedFirst) {
   apps.insert(apps.end(), plugins.begin(), plugins.end());
   EXPECT_FALSE(m->performMigration());
   std::vector<std::string> migrating;
-  for (const std::string& message : mgtest::hostMessages(log_))
+  for (const std::string& message : hostMessages(log_))
     if (message.starts_with("SLAppMigrator: Migrating ")) migrating.push_back(message);
   EXPECT_EQ(migrating, apps);
   EXPECT_EQ(Access::countItemsMigrated(*m), 5u);
   EXPECT_FLOAT_EQ(m->migrationProgress(), 1.0f);
 }
 
-// One application with its data and one group, from the old layout to the
-// registry's containers.
+// One application unknown to the registry, with its data and one group, from
+// the old layout to the registry's containers: placeholder first, then the
+// data, then the real bundle.
 TEST_F(StartupAndMainPassTest, OneContainerEndToEnd) {
   const std::string c = oldRoot() + "/C", group = below("/private/var/mobile/OldGroups/G");
   const sl::String identifier("com.example.a");
-  mgtest::makeBundle(c + "/A.app", identifier.str(), "1.0", {"group.example.g"});
+  makeBundle(c + "/A.app", identifier.str(), "1.0", {"group.example.g"});
   for (const char* item : {"Documents", "Library", "tmp", "Tillbox"})
     sl::test::writeFile(c + "/" + item + "/file", item);
+  // Marker-family names are no leftovers.
+  for (const char* name : {"com.vantor.stowline.migration_marker", "com.vantor.stowline.placeholder"})
+    sl::test::writeFile(c + "/" + name);
   sl::test::writeFile(group + "/shared", "group data");
-  mgtest::writeInstallMap({{"group.example.g", group}});
+  writeInstallMap({{"group.example.g", group}});
   writeOSRelease();
 
   auto m = make();
@@ -241,6 +227,7 @@ TEST_F(StartupAndMainPassTest, OneContainerEndToEnd) {
 
   auto proxy = RGBundleProxy::bundleProxyForIdentifier(identifier);
   ASSERT_TRUE(proxy);
+  EXPECT_EQ(proxy->bundleType().str(), "User");
   const std::string dataContainer = proxy->dataContainerURL().path();
   for (const char* item : {"Documents", "Library", "tmp", "Tillbox"})
     EXPECT_EQ(sl::test::readFile(dataContainer + "/" + item + "/file"), item);
@@ -260,6 +247,11 @@ TEST_F(StartupAndMainPassTest, OneContainerEndToEnd) {
   EXPECT_EQ(lines[0], (Line{N, "SLAppMigrator: 1 items to migrate"}));
   EXPECT_EQ(lines[1], (Line{N, "SLAppMigrator: Introspecting " + u(c, true)}));
   EXPECT_EQ(lines.back(), (Line{N, "SLAppMigrator: Recorded current system version as 21A42"}));
+  for (const std::string& line : {"Moving data from container " + u(c, true) + " to " + u(dataContainer, true),
+                                  "Staging and installing app com.example.a at " + u(c + "/A.app", true) +
+                                      " (and secondary (null))",
+                                  "Removing container for com.example.a at " + u(c, true)})
+    EXPECT_NE(std::find(lines.begin(), lines.end(), Line{N, "SLAppMigrator: " + line}), lines.end()) << line;
 }
 
 TEST_F(StartupAndMainPassTest, HostLoadsThePlugIn) {
