@@ -31,8 +31,7 @@ TEST(EmbeddedRegistryTest, PlaceholderThenRealBundleKeepsDataContainer) {
   const std::string placeholder = root / "tmp/com.example.app.app";
   makeBundle(placeholder, "com.example.app");
   sl::Error error;
-  ASSERT_TRUE(registry->installApplication(fileURL(placeholder, true), options("com.example.app", RGPackageTypePlaceholder),
-                                           &error))
+  ASSERT_TRUE(install(*registry, placeholder, "com.example.app", RGPackageTypePlaceholder, &error))
       << error.description();
   EXPECT_FALSE(exists(placeholder));
   auto first = registry->bundleProxyForIdentifier("com.example.app");
@@ -55,8 +54,7 @@ TEST(EmbeddedRegistryTest, PlaceholderThenRealBundleKeepsDataContainer) {
   sl::test::writeFile(package + "/Manifest.plist", "<plist/>");
   const ino_t inode = inodeOf(app);
   Reports reports;
-  ASSERT_TRUE(registry->installApplication(fileURL(package, true), options("com.example.app", RGPackageTypeCustomer),
-                                           &error, reports.handler()))
+  ASSERT_TRUE(install(*registry, package, "com.example.app", RGPackageTypeCustomer, &error, reports.handler()))
       << error.description();
   EXPECT_FALSE(exists(package));
   auto second = registry->bundleProxyForIdentifier("com.example.app");
@@ -79,16 +77,11 @@ TEST(EmbeddedRegistryTest, PlaceholderThenRealBundleKeepsDataContainer) {
 
   // ---- Repeats nothing: the same package path and identifier again ----
   sl::test::makeDirs(package + "/Payload");
-  ASSERT_TRUE(registry->installApplication(fileURL(package, true), options("com.example.app", RGPackageTypeCustomer),
-                                           &error));
+  ASSERT_TRUE(install(*registry, package, "com.example.app", RGPackageTypeCustomer));
   EXPECT_FALSE(exists(package));
   EXPECT_EQ(registry->bundleProxyForIdentifier("com.example.app")->bundleContainerURL().path(), container);
 
-  // ---- Through the default workspace, and after reopening ----
-  RGApplicationWorkspace::setDefaultWorkspace(registry);
-  EXPECT_TRUE(RGApplicationWorkspace::defaultWorkspace().applicationIsInstalled("com.example.app"));
-  EXPECT_FALSE(RGBundleProxy::bundleProxyForIdentifier("com.example.other"));
-  RGApplicationWorkspace::setDefaultWorkspace(nullptr);
+  // ---- After reopening ----
   registry.reset();
   registry = root.open();
   EXPECT_EQ(registry->bundleProxyForIdentifier("com.example.app")->dataContainerURL().path(), data);
@@ -97,13 +90,10 @@ TEST(EmbeddedRegistryTest, PlaceholderThenRealBundleKeepsDataContainer) {
 TEST(EmbeddedRegistryTest, TwoApplicationsShareOneGroup) {
   RegistryRoot root;
   auto registry = root.open();
-  sl::Error error;
   makeCustomerPackage(root / "pkgA", "com.example.a", "1", {"group.shared", "group.a"});
   makeCustomerPackage(root / "pkgB", "com.example.b", "1", {"group.shared"});
-  ASSERT_TRUE(registry->installApplication(fileURL(root / "pkgA", true), options("com.example.a", RGPackageTypeCustomer),
-                                           &error));
-  ASSERT_TRUE(registry->installApplication(fileURL(root / "pkgB", true), options("com.example.b", RGPackageTypeCustomer),
-                                           &error));
+  ASSERT_TRUE(install(*registry, root / "pkgA", "com.example.a", RGPackageTypeCustomer));
+  ASSERT_TRUE(install(*registry, root / "pkgB", "com.example.b", RGPackageTypeCustomer));
   const sl::Dictionary a = registry->bundleProxyForIdentifier("com.example.a")->groupContainerURLs();
   const sl::Dictionary b = registry->bundleProxyForIdentifier("com.example.b")->groupContainerURLs();
   ASSERT_EQ(a.count(), 2u);
@@ -116,23 +106,23 @@ TEST(EmbeddedRegistryTest, TwoApplicationsShareOneGroup) {
 
   // A file-system step that fails (a new group container cannot be made)
   // undoes what was done and still consumes the package.
-  const size_t bundleContainers = SLFileManager::defaultManager()
-                                      .urlsForItemsInDirectoryAtURL(fileURL(registry->bundleContainersRoot(), true), false)
-                                      ->size();
+  auto bundleContainers = [&] {
+    return SLFileManager::defaultManager()
+        .urlsForItemsInDirectoryAtURL(fileURL(registry->bundleContainersRoot(), true), false)
+        ->size();
+  };
+  const size_t bundleContainersBefore = bundleContainers();
   sl::test::forceRemove(registry->groupContainersRoot());
   sl::test::writeFile(registry->groupContainersRoot());
   makeCustomerPackage(root / "pkgC", "com.example.c", "1", {"group.new"});
   Reports reports;
-  EXPECT_FALSE(registry->installApplication(fileURL(root / "pkgC", true), options("com.example.c", RGPackageTypeCustomer),
-                                            &error, reports.handler()));
+  sl::Error error;
+  EXPECT_FALSE(install(*registry, root / "pkgC", "com.example.c", RGPackageTypeCustomer, &error, reports.handler()));
   EXPECT_TRUE(error.isPOSIX(ENOTDIR)) << error.description();
   EXPECT_EQ(reports.lastError(), kRGProgressErrorInstallFailed);
   EXPECT_FALSE(exists(root / "pkgC"));
   EXPECT_FALSE(registry->applicationIsInstalled("com.example.c"));
-  EXPECT_EQ(SLFileManager::defaultManager()
-                .urlsForItemsInDirectoryAtURL(fileURL(registry->bundleContainersRoot(), true), false)
-                ->size(),
-            bundleContainers);
+  EXPECT_EQ(bundleContainers(), bundleContainersBefore);
 }
 
 // Refusals, the blacklist and built-in applications. Every refusal consumes
@@ -218,19 +208,13 @@ TEST(EmbeddedRegistryTest, RefusalsBlacklistAndBuiltInApplications) {
 TEST(EmbeddedRegistryTest, PackageOnAnotherVolumeIsCopied) {
   RegistryRoot root;
   TempDir other;  // $TMPDIR or /tmp, on the disk
-  struct stat rootStat {};
-  struct stat otherStat {};
-  ASSERT_EQ(::stat(root.path().c_str(), &rootStat), 0);
-  ASSERT_EQ(::stat(other.path().c_str(), &otherStat), 0);
-  if (rootStat.st_dev == otherStat.st_dev) GTEST_SKIP() << "/dev/shm and the temporary directory share a volume";
+  if (sameVolume(root.path(), other.path())) GTEST_SKIP() << "/dev/shm and the temporary directory share a volume";
   auto registry = root.open();
   const std::string package = other / "Staging";
   makeCustomerPackage(package, "com.example.far");
   sl::test::writeFile(package + "/JukoraMetadata.plist", "meta");
   sl::Error error;
-  ASSERT_TRUE(registry->installApplication(fileURL(package, true), options("com.example.far", RGPackageTypeCustomer),
-                                           &error))
-      << error.description();
+  ASSERT_TRUE(install(*registry, package, "com.example.far", RGPackageTypeCustomer, &error)) << error.description();
   EXPECT_FALSE(exists(package));
   EXPECT_FALSE(exists(other / ".Staging.rgtrash"));
   auto proxy = registry->bundleProxyForIdentifier("com.example.far");
@@ -261,8 +245,7 @@ TEST(EmbeddedRegistryTest, SafeHarborsAndDataProtection) {
   EXPECT_EQ(registry->safeHarborForIdentifier("com.example.h")->first, root / "harbor") << "the entry stays";
 
   makeCustomerPackage(root / "pkg", "com.example.p");
-  ASSERT_TRUE(registry->installApplication(fileURL(root / "pkg", true), options("com.example.p", RGPackageTypeCustomer),
-                                           &error));
+  ASSERT_TRUE(install(*registry, root / "pkg", "com.example.p", RGPackageTypeCustomer));
   const sl::URL data = registry->bundleProxyForIdentifier("com.example.p")->dataContainerURL();
   EXPECT_TRUE(StowlineUpdateContainerDataProtectionForMigratorOnly(
       sl::Dictionary{{kSLUpdateSystemAppDataContainerDataProtection, sl::Boolean(true)}}));

@@ -49,6 +49,21 @@ inline sl::Dictionary options(const std::string& identifier, const char* package
                         {RGBundleIdentifierOptionKey, sl::String(identifier)}};
 }
 
+// Installs `package` with options(identifier, packageType).
+inline bool install(EmbeddedRegistry& registry, const std::string& package, const std::string& identifier,
+                    const char* packageType, sl::Error* error = nullptr, RGProgressHandler handler = nullptr) {
+  return registry.installApplication(fileURL(package, true), options(identifier, packageType), error, handler);
+}
+
+// Whether both paths are on one volume.
+inline bool sameVolume(const std::string& a, const std::string& b) {
+  struct stat sa {};
+  struct stat sb {};
+  EXPECT_EQ(::stat(a.c_str(), &sa), 0) << a;
+  EXPECT_EQ(::stat(b.c_str(), &sb), 0) << b;
+  return sa.st_dev == sb.st_dev;
+}
+
 inline ino_t inodeOf(const std::string& path) {
   struct stat st {};
   return ::lstat(path.c_str(), &st) == 0 ? st.st_ino : 0;

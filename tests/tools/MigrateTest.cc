@@ -2,9 +2,7 @@
 // by hand, and the installed program.
 #include <gtest/gtest.h>
 
-#include <filesystem>
 #include <regex>
-#include <sstream>
 #include <string>
 #include <vector>
 
@@ -14,18 +12,12 @@
 
 namespace {
 
-namespace fs = std::filesystem;
 using sl::test::ProgramResult;
 using sl::test::runProgram;
+using sl::test::stowline;
 using sl::test::TempDir;
 
-const std::string kProgram = SL_STOWLINE_PATH;
 const std::string kOldRoot = "/private/var/mobile/Applications";
-
-ProgramResult stowline(std::vector<std::string> args) {
-  args.insert(args.begin(), kProgram);
-  return runProgram(args, {"NO_COLOR"});
-}
 
 // An old container root with one application container, and the system
 // version the migration records.
@@ -39,23 +31,6 @@ void makeOldLayout(const std::string& root) {
   sl::test::writeFile(app + "/Exec", "binary");
   sl::test::writeFile(root + kOldRoot + "/C/Documents/notes", "user data");
   sl::test::writeFile(root + "/etc/os-release", "NAME=Testix\nVERSION_ID=9.1\nBUILD_ID=21A42\n");
-}
-
-// Every entry below `root` with its type, mode and content (links: target).
-std::string listing(const std::string& root) {
-  std::ostringstream out;
-  std::vector<std::string> lines;
-  for (const auto& entry : fs::recursive_directory_iterator(root)) {
-    const fs::file_status st = entry.symlink_status();
-    std::string line = entry.path().string() + " " + std::to_string(static_cast<int>(st.type())) + " " +
-                       std::to_string(static_cast<int>(st.permissions()));
-    if (st.type() == fs::file_type::regular) line += " " + sl::test::readFile(entry.path());
-    if (st.type() == fs::file_type::symlink) line += " -> " + fs::read_symlink(entry.path()).string();
-    lines.push_back(line);
-  }
-  std::sort(lines.begin(), lines.end());
-  for (const std::string& line : lines) out << line << "\n";
-  return out.str();
 }
 
 size_t lineCount(const std::string& text) { return static_cast<size_t>(std::count(text.begin(), text.end(), '\n')); }
@@ -128,7 +103,7 @@ TEST(MigrateTest, SummaryLogsAndExitStatus) {
 TEST(MigrateTest, UsageErrorsChangeNothing) {
   TempDir root(TempDir::kShm);
   makeOldLayout(root.path());
-  const std::string before = listing(root.path());
+  const auto before = sl::test::listTree(root.path());
   struct Case {
     std::vector<std::string> args;
     std::string message;  // in the first line of standard error
@@ -155,10 +130,8 @@ TEST(MigrateTest, UsageErrorsChangeNothing) {
     EXPECT_EQ(r.out, "");
     EXPECT_TRUE(r.err.starts_with("stowline migrate: ")) << r.err;
     EXPECT_NE(r.err.substr(0, r.err.find('\n')).find(c.message), std::string::npos) << r.err;
-    if (c.oneLine) {
-      EXPECT_EQ(lineCount(r.err), 1u) << r.err;
-    }
-    EXPECT_EQ(listing(root.path()), before);
+    EXPECT_TRUE(!c.oneLine || lineCount(r.err) == 1u) << r.err;
+    EXPECT_EQ(sl::test::listTree(root.path()), before);
   }
 }
 

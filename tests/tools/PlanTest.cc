@@ -1,12 +1,9 @@
 // stowline plan, run as a subprocess: it changes nothing, classifies every
 // entry, and agrees with what migrate then does.
-#include <dirent.h>
 #include <gtest/gtest.h>
 #include <openssl/evp.h>
-#include <sys/stat.h>
 #include <sys/xattr.h>
 
-#include <map>
 #include <memory>
 #include <string>
 #include <vector>
@@ -27,46 +24,6 @@ std::string sha256(const std::string& bytes) {
   char two[3];
   for (unsigned int i = 0; i < size; ++i) hex += (std::snprintf(two, sizeof two, "%02x", digest[i]), two);
   return hex;
-}
-
-// Every item below `path`: type and mode, owner, size, change and
-// modification times in nanoseconds, extended attributes with their values,
-// the link target or the SHA-256 of the contents.
-void snapshot(const std::string& path, std::map<std::string, std::string>& out) {
-  struct stat st;
-  ASSERT_EQ(::lstat(path.c_str(), &st), 0) << path;
-  std::string line = std::to_string(st.st_mode) + " " + std::to_string(st.st_uid) + ":" + std::to_string(st.st_gid) +
-                     " " + std::to_string(st.st_size) + " m" + std::to_string(st.st_mtim.tv_sec) + "." +
-                     std::to_string(st.st_mtim.tv_nsec) + " c" + std::to_string(st.st_ctim.tv_sec) + "." +
-                     std::to_string(st.st_ctim.tv_nsec);
-  char names[4096];
-  const ssize_t n = ::llistxattr(path.c_str(), names, sizeof names);
-  for (ssize_t i = 0; i < n; i += static_cast<ssize_t>(std::strlen(names + i)) + 1) {
-    char value[4096];
-    const ssize_t size = ::lgetxattr(path.c_str(), names + i, value, sizeof value);
-    line +=
-        std::string(" x:") + (names + i) + "=" + std::string(value, static_cast<size_t>(std::max<ssize_t>(size, 0)));
-  }
-  if (S_ISREG(st.st_mode)) line += " " + sha256(sl::test::readFile(path));
-  if (S_ISLNK(st.st_mode)) {
-    char target[4096];
-    const ssize_t size = ::readlink(path.c_str(), target, sizeof target);
-    line += " -> " + std::string(target, static_cast<size_t>(std::max<ssize_t>(size, 0)));
-  }
-  out[path] = line;
-  if (!S_ISDIR(st.st_mode)) return;
-  std::unique_ptr<DIR, int (*)(DIR*)> dir(::opendir(path.c_str()), ::closedir);
-  ASSERT_TRUE(dir) << path;
-  while (const dirent* entry = ::readdir(dir.get())) {
-    const std::string name = entry->d_name;
-    if (name != "." && name != "..") snapshot(path + "/" + name, out);
-  }
-}
-
-std::map<std::string, std::string> snapshotOf(const std::string& root) {
-  std::map<std::string, std::string> out;
-  snapshot(root, out);
-  return out;
 }
 
 // The JSON member of the item for `path`: the writer puts "path" first and
@@ -123,10 +80,10 @@ TEST_F(PlanTest, ChangesNothingAndAgreesWithMigrate) {
 
   // The registry stays open: what it recorded is still in its write-ahead
   // log, which plan must read without touching it.
-  const auto before = snapshotOf(root);
-  const sl::test::ProgramResult text = sl::test::runProgram({SL_STOWLINE_PATH, "plan", "--root", root});
-  const sl::test::ProgramResult json = sl::test::runProgram({SL_STOWLINE_PATH, "plan", "--root", root, "--json"});
-  EXPECT_EQ(snapshotOf(root), before);
+  const auto before = sl::test::listTree(root, sha256, true);
+  const sl::test::ProgramResult text = sl::test::stowline({"plan", "--root", root});
+  const sl::test::ProgramResult json = sl::test::stowline({"plan", "--root", root, "--json"});
+  EXPECT_EQ(sl::test::listTree(root, sha256, true), before);
   ASSERT_EQ(text.status, 0) << text.err;
   ASSERT_EQ(json.status, 0) << json.err;
   EXPECT_NE(text.out.find("  identifier: com.plan.a\n  container type: App (migrated early)"), std::string::npos)
@@ -149,24 +106,13 @@ TEST_F(PlanTest, ChangesNothingAndAgreesWithMigrate) {
     EXPECT_NE(json.out.find(fact), std::string::npos) << fact << "\n" << json.out;
   }
 
-  // Then migrate: the program when it is built, else the migrator in this
-  // process. What plan expected to go is gone, what it expected to stay
-  // stays.
+  // Then migrate: what plan expected to go is gone, what it expected to
+  // stay stays.
   RGApplicationWorkspace::setDefaultWorkspace(nullptr);
   SLInstallerLibrary::setDefaultLibrary(nullptr);
   registry_.reset();
-  const sl::test::ProgramResult migrate = sl::test::runProgram({SL_STOWLINE_PATH, "migrate", "--root", root});
-  if (migrate.err.find("not built yet") != std::string::npos) {
-    registry_ = EmbeddedRegistry::open(SLGlobalConfiguration::sharedInstance(), &error);
-    ASSERT_TRUE(registry_) << error.description();
-    RGApplicationWorkspace::setDefaultWorkspace(registry_);
-    SLInstallerLibrary::setDefaultLibrary(registry_);
-    std::unique_ptr<SLAppMigrator> migrator = SLAppMigrator::create();
-    ASSERT_TRUE(migrator);
-    EXPECT_FALSE(migrator->performMigration());
-  } else {
-    EXPECT_EQ(migrate.status, 1) << migrate.err;
-  }
+  const sl::test::ProgramResult migrate = sl::test::stowline({"migrate", "--root", root});
+  EXPECT_EQ(migrate.status, 1) << migrate.err;
   for (const auto& [name, classification] : expected) {
     const std::string after = field(json.out, entry(name), "afterMigration");
     EXPECT_EQ(after, exists(entry(name)) ? "stays" : "gone") << name;
@@ -179,9 +125,9 @@ TEST(PlanUsageTest, ExitStatuses) {
   const std::pair<std::vector<std::string>, int> cases[] = {
       {{"--help"}, 0}, {{"--bogus"}, 2}, {{"--root"}, 2}, {{"--root", "/nonexistent/root"}, 2}, {{"--json", "x"}, 2}};
   for (const auto& [args, status] : cases) {
-    std::vector<std::string> argv{SL_STOWLINE_PATH, "plan"};
+    std::vector<std::string> argv{"plan"};
     argv.insert(argv.end(), args.begin(), args.end());
-    const sl::test::ProgramResult result = sl::test::runProgram(argv);
+    const sl::test::ProgramResult result = sl::test::stowline(argv);
     EXPECT_EQ(result.status, status) << args.front();
     EXPECT_EQ(result.out.empty(), status != 0) << args.front();
   }

@@ -1,17 +1,27 @@
 // Runs a program as a subprocess and collects its exit status, standard
-// output and standard error, for the tests of the stowline program.
+// output and standard error, for the tests of the stowline program; and a
+// listing of a tree to compare before and after a run.
 #pragma once
 
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <poll.h>
 #include <spawn.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
+#include <sys/xattr.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <filesystem>
+#include <map>
+#include <sstream>
 #include <string>
 #include <vector>
+
+#include "TestSupport/TestSupport.h"
 
 extern char** environ;
 
@@ -88,6 +98,48 @@ inline ProgramResult runProgram(const std::vector<std::string>& args, const std:
   close(outPipe[0]);
   close(errPipe[0]);
   return result;
+}
+
+#ifdef SL_STOWLINE_PATH
+// The stowline program with `args`, without NO_COLOR or STOWLINE_ROOT in its
+// environment.
+inline ProgramResult stowline(std::vector<std::string> args) {
+  args.insert(args.begin(), SL_STOWLINE_PATH);
+  return runProgram(args, {"NO_COLOR", "STOWLINE_ROOT"});
+}
+#endif
+
+// Every item in the tree at `root` (itself as "."), by path relative to it:
+// mode in octal, owner, size, modification time in nanoseconds, extended
+// attributes with their values, then the link target or the contents (or
+// `digest` of them). `withChangeTime` adds the change time.
+inline std::map<std::string, std::string> listTree(const std::string& root,
+                                                   std::string (*digest)(const std::string&) = nullptr,
+                                                   bool withChangeTime = false) {
+  std::map<std::string, std::string> tree;
+  std::vector<std::filesystem::path> paths{root};
+  for (const auto& entry : std::filesystem::recursive_directory_iterator(root)) paths.push_back(entry.path());
+  for (const std::filesystem::path& path : paths) {
+    struct stat st;
+    EXPECT_EQ(::lstat(path.c_str(), &st), 0) << path;
+    std::ostringstream line;
+    line << std::oct << st.st_mode << std::dec << ' ' << st.st_uid << ':' << st.st_gid << ' ' << st.st_size << " m"
+         << st.st_mtim.tv_sec << '.' << st.st_mtim.tv_nsec;
+    if (withChangeTime) line << " c" << st.st_ctim.tv_sec << '.' << st.st_ctim.tv_nsec;
+    char names[4096], value[4096];
+    const ssize_t n = ::llistxattr(path.c_str(), names, sizeof names);
+    for (ssize_t i = 0; i < n; i += static_cast<ssize_t>(std::strlen(names + i)) + 1) {
+      const ssize_t size = ::lgetxattr(path.c_str(), names + i, value, sizeof value);
+      line << " x:" << names + i << '=' << std::string(value, static_cast<size_t>(std::max<ssize_t>(size, 0)));
+    }
+    if (S_ISREG(st.st_mode)) {
+      const std::string bytes = readFile(path);
+      line << ' ' << (digest ? digest(bytes) : bytes);
+    }
+    if (S_ISLNK(st.st_mode)) line << " -> " << std::filesystem::read_symlink(path).string();
+    tree[std::filesystem::relative(path, root).string()] = line.str();
+  }
+  return tree;
 }
 
 }  // namespace sl::test
