@@ -143,6 +143,7 @@
 #include <memory>
 #include <set>
 #include <string>
+#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -428,21 +429,23 @@ struct TopPath {
 };
 
 int splitTop(const char* path, TopPath& out) {
-  std::string p(path);
+  std::string_view p(path);
   if (p.empty()) return ENOENT;
   while (p.size() > 1 && p.back() == '/') {
-    p.pop_back();
+    p.remove_suffix(1);
     out.trailingSlash = true;
   }
-  size_t slash = p.rfind('/');
-  std::string name = slash == std::string::npos ? p : p.substr(slash + 1);
+  const size_t slash = p.rfind('/');
+  const std::string_view name = slash == std::string_view::npos ? p : p.substr(slash + 1);
   if (p == "/" || name == "." || name == "..") {
-    out.parent = p;
-    out.name = ".";
+    out.parent.assign(p);
+    out.name.assign(".");
     return 0;
   }
-  out.parent = slash == std::string::npos ? "." : slash == 0 ? "/" : p.substr(0, slash);
-  out.name = std::move(name);
+  out.parent.assign(slash == std::string_view::npos ? std::string_view(".")
+                    : slash == 0                    ? std::string_view("/")
+                                                    : p.substr(0, slash));
+  out.name.assign(name);
   return 0;
 }
 
