@@ -18,6 +18,8 @@ int registryCommand(Arguments args);
 int fixtureCommand(Arguments args);
 int digestCommand(Arguments args);
 int configCommand(Arguments args);
+int manifestCommand(Arguments args);
+int verifyCommand(Arguments args);
 
 // "stowline <command>: <message>" and a hint at --help on standard error;
 // returns 2. For mistakes in the command line itself.

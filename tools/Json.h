@@ -48,4 +48,12 @@ class JsonWriter {
   bool needComma_ = false;
 };
 
+// Reads one JSON document strictly (no trailing commas, comments or text
+// after the value). Objects become dictionaries, arrays arrays, strings
+// strings (\uXXXX decoded to UTF-8, and the writer's \xHH for a byte of
+// 0x80 or above turned back into that byte), numbers numbers (integers as
+// integers when they fit), true and false booleans, null a null value.
+// Null with *error set on malformed input.
+sl::Value parseJson(std::string_view text, sl::Error* error);
+
 }  // namespace stowline

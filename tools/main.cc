@@ -19,6 +19,8 @@ constexpr char kUsage[] =
     "  fixture    write a sample old layout\n"
     "  digest     print the SHA-256 of files\n"
     "  config     print the settings and every path of the configuration\n"
+    "  manifest   record every user-data item of the old layout as JSON\n"
+    "  verify     check a migrated layout against a manifest\n"
     "\n"
     "Run 'stowline <command> --help' for a command's options.\n";
 
@@ -45,6 +47,8 @@ int main(int argc, char** argv) {
   if (command == "fixture") return stowline::fixtureCommand(args);
   if (command == "digest") return stowline::digestCommand(args);
   if (command == "config") return stowline::configCommand(args);
+  if (command == "manifest") return stowline::manifestCommand(args);
+  if (command == "verify") return stowline::verifyCommand(args);
   std::fprintf(stderr, "stowline: unknown command '%s'\n%s", argv[1], kUsage);
   return 2;
 }
