@@ -71,6 +71,45 @@ TEST_F(ContainerMigrationTest, FailuresBeforeTheDataMovesKeepTheContainerWithIts
                                              "/ for com.example.left: (\n    file://" + container + "/notes\n)"));
 }
 
+// A registry whose proxy knows the application but gives no data
+// container: the migrator says what the proxy did give, and keeps the
+// container.
+TEST_F(ContainerMigrationTest, ProxyWithoutDataContainerIsDescribed) {
+  struct Proxy : RGBundleProxy {
+    sl::String bundleIdentifier() const override { return sl::String("com.example.nodata"); }
+    sl::String bundleType() const override { return sl::String("User"); }
+    sl::URL bundleURL() const override { return sl::URL::fileURLWithPath("/b/N.app", true); }
+    sl::URL bundleContainerURL() const override { return sl::URL(); }
+    sl::URL dataContainerURL() const override { return sl::URL(); }
+    sl::Dictionary groupContainerURLs() const override { return sl::Dictionary::create(); }
+    bool foundBackingBundle() const override { return false; }
+  };
+  struct Workspace : RGApplicationWorkspace {
+    bool applicationIsInstalled(const sl::String&) override { return true; }
+    bool installApplication(const sl::URL&, const sl::Dictionary&, sl::Error*, const RGProgressHandler&) override {
+      return false;
+    }
+    std::shared_ptr<RGBundleProxy> bundleProxyForIdentifier(const sl::String&) override {
+      return std::make_shared<Proxy>();
+    }
+  };
+  RGApplicationWorkspace::setDefaultWorkspace(std::make_shared<Workspace>());
+  const sl::Dictionary record = makeContainer("N", "com.example.nodata");
+  log_.clear();
+  EXPECT_FALSE(migrate(record));
+  EXPECT_TRUE(exists(path(record, "ContainerPath") + "/Documents/doc.txt"));
+  const Lines expected = {
+      {sl::kLogLevelNotice, "SLAppMigrator: App com.example.nodata is already installed, so not creating placeholder."},
+      {sl::kLogLevelError, "SLAppMigrator: Failed to get data container URL for com.example.nodata"},
+      {sl::kLogLevelError, "SLAppMigrator: Proxy had bundle identifier com.example.nodata"},
+      {sl::kLogLevelError, "SLAppMigrator: Proxy had bundle type User"},
+      {sl::kLogLevelError, "SLAppMigrator: Proxy had bundle URL file:///b/N.app/"},
+      {sl::kLogLevelError, "SLAppMigrator: Proxy had bundle container URL (null)"},
+      {sl::kLogLevelError, "SLAppMigrator: Proxy did not have backing bundle"},
+  };
+  EXPECT_EQ(hostLines(log_), expected);
+}
+
 TEST_F(ContainerMigrationTest, ContainerGoesOnceTheDataHasMoved) {
   // An old bundle that is a placeholder itself: data moved, nothing installed.
   const sl::Dictionary placeholder = makeContainer("P", "com.example.p");
