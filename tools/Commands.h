@@ -4,6 +4,7 @@
 // a file), 2 for a usage error or anything the user must fix first.
 #pragma once
 
+#include <optional>
 #include <span>
 #include <string>
 #include <string_view>
@@ -20,6 +21,10 @@ int digestCommand(Arguments args);
 int configCommand(Arguments args);
 int manifestCommand(Arguments args);
 int verifyCommand(Arguments args);
+
+// The value of the option at args[*i]: the next argument when there is one
+// and it is not empty, with *i moved onto it; nullopt otherwise.
+std::optional<std::string> optionValue(Arguments args, size_t* i);
 
 // "stowline <command>: <message>" and a hint at --help on standard error;
 // returns 2. For mistakes in the command line itself.

@@ -132,8 +132,9 @@ int configCommand(Arguments args) {
       std::fputs(kHelp, stdout);
       return 0;
     } else if (arg == "--root") {
-      if (i + 1 >= args.size() || args[i + 1][0] == '\0') return usageError("config", "--root needs a directory");
-      root = args[++i];
+      std::optional<std::string> value = optionValue(args, &i);
+      if (!value) return usageError("config", "--root needs a directory");
+      root = *value;
     } else if (arg == "--json") {
       json = true;
     } else {

@@ -246,10 +246,11 @@ int manifestCommand(Arguments args) {
       return 0;
     }
     if (arg == "--root" || arg == "--output") {
-      if (i + 1 >= args.size() || args[i + 1][0] == '\0') {
+      std::optional<std::string> value = optionValue(args, &i);
+      if (!value) {
         return usageError(kCommand, std::string(arg) + (arg == "--root" ? " needs a directory" : " needs a file"));
       }
-      (arg == "--root" ? root : output) = args[++i];
+      (arg == "--root" ? root : output) = *value;
     } else {
       return usageError(kCommand, "unknown option '" + std::string(arg) + "'");
     }

@@ -437,9 +437,9 @@ int planCommand(Arguments args) {
     if (arg == "--json") {
       json = true;
     } else if (arg == "--root") {
-      if (i + 1 >= args.size()) return usageError(kCommand, "--root needs a directory");
-      root = args[++i];
-      if (root.empty()) return usageError(kCommand, "--root needs a directory");
+      std::optional<std::string> value = optionValue(args, &i);
+      if (!value) return usageError(kCommand, "--root needs a directory");
+      root = *value;
     } else {
       return usageError(kCommand, "unknown option '" + std::string(arg) + "'");
     }

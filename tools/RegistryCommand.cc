@@ -272,10 +272,9 @@ int registryCommand(Arguments args) {
       return 0;
     }
     if (arg == "--root") {
-      if (i + 1 >= args.size() || std::string_view(args[i + 1]).empty()) {
-        return usageError(kCommand, "--root needs a directory");
-      }
-      root = args[++i];
+      std::optional<std::string> value = optionValue(args, &i);
+      if (!value) return usageError(kCommand, "--root needs a directory");
+      root = *value;
     } else if (arg == "--json") {
       asJson = true;
     } else if (arg == "--placeholder") {

@@ -194,8 +194,9 @@ int verifyCommand(Arguments args) {
     if (arg == "--json") {
       json = true;
     } else if (arg == "--root") {
-      if (i + 1 >= args.size() || args[i + 1][0] == '\0') return usageError(kCommand, "--root needs a directory");
-      root = args[++i];
+      std::optional<std::string> value = optionValue(args, &i);
+      if (!value) return usageError(kCommand, "--root needs a directory");
+      root = *value;
     } else if (!arg.empty() && arg[0] == '-') {
       return usageError(kCommand, "unknown option '" + std::string(arg) + "'");
     } else if (!manifestPath.empty()) {
