@@ -20,6 +20,7 @@
 
 #include "FileManager/SLFileManager.h"
 #include "FileManager/StowlineAdditions.h"
+#include "Platform/Mutations.h"
 #include "Support/Errors.h"
 #include "Support/Log.h"
 
@@ -97,7 +98,7 @@ bool SLFileManager::createSymbolicLinkAtURL(const sl::URL& url, const sl::URL& w
   static constexpr char kFunctionName[] = "-[SLFileManager createSymbolicLinkAtURL:withDestinationURL:error:]";
   const char* content = withDestinationURL.fileSystemRepresentation();
   const char* linkPath = url.fileSystemRepresentation();
-  if (::symlink(content, linkPath) != 0) {
+  if (sl::mut::symlink(content, linkPath) != 0) {
     int symlinkErrno = errno;
     return sl::fail(error, _CreateError(kFunctionName, __LINE__, sl::kPOSIXErrorDomain, symlinkErrno,
                                         "Could not create symlink containing %s at %s: %s", content, linkPath,

@@ -8,6 +8,8 @@
 
 #include <array>
 
+#include "Platform/Mutations.h"
+
 namespace sl {
 
 namespace {
@@ -61,14 +63,14 @@ int setxattr(const char* path, const char* name, const void* value, size_t size,
   if (!validArguments(name, position, options)) return -1;
   const std::string linuxName = linuxAttributeName(name);
   const int flags = linuxSetFlags(options);
-  return nofollow(options) ? ::lsetxattr(path, linuxName.c_str(), value, size, flags)
-                           : ::setxattr(path, linuxName.c_str(), value, size, flags);
+  return nofollow(options) ? mut::lsetxattr(path, linuxName.c_str(), value, size, flags)
+                           : mut::setxattr(path, linuxName.c_str(), value, size, flags);
 }
 
 int removexattr(const char* path, const char* name, int options) {
   if (!validArguments(name, 0, options)) return -1;
   const std::string linuxName = linuxAttributeName(name);
-  return nofollow(options) ? ::lremovexattr(path, linuxName.c_str()) : ::removexattr(path, linuxName.c_str());
+  return nofollow(options) ? mut::lremovexattr(path, linuxName.c_str()) : mut::removexattr(path, linuxName.c_str());
 }
 
 // A descriptor names the item it was opened on, so XATTR_NOFOLLOW has
@@ -80,7 +82,7 @@ ssize_t fgetxattr(int fd, const char* name, void* value, size_t size, uint32_t p
 
 int fsetxattr(int fd, const char* name, const void* value, size_t size, uint32_t position, int options) {
   if (!validArguments(name, position, options)) return -1;
-  return ::fsetxattr(fd, linuxAttributeName(name).c_str(), value, size, linuxSetFlags(options));
+  return mut::fsetxattr(fd, linuxAttributeName(name).c_str(), value, size, linuxSetFlags(options));
 }
 
 }  // namespace sl

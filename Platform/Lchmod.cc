@@ -7,6 +7,8 @@
 
 #include <cerrno>
 
+#include "Platform/Mutations.h"
+
 namespace sl {
 
 int lchmod(const char* path, mode_t mode) {
@@ -19,7 +21,7 @@ int lchmod(const char* path, mode_t mode) {
   // (O_PATH|O_NOFOLLOW) and refuses a link with EOPNOTSUPP, so the target of
   // such a link is never changed; a non-link has its mode changed as by
   // chmod.
-  return ::fchmodat(AT_FDCWD, path, mode, AT_SYMLINK_NOFOLLOW);
+  return mut::fchmodat(AT_FDCWD, path, mode, AT_SYMLINK_NOFOLLOW);
 }
 
 }  // namespace sl

@@ -26,6 +26,8 @@
 #include <string>
 #include <vector>
 
+#include "Platform/Mutations.h"
+
 namespace sl {
 namespace {
 
@@ -54,7 +56,7 @@ int mkpath_np(const char* path, mode_t mode) {
   // "a/b/" names a/b; the root keeps its slash.
   while (p.size() > 1 && p.back() == '/') p.pop_back();
 
-  if (mkdir(p.c_str(), mode) == 0) return 0;
+  if (mut::mkdir(p.c_str(), mode) == 0) return 0;
   int err = errno;
   if (err == EEXIST) return lastStanding(p);
   if (err != ENOENT) return err;
@@ -74,7 +76,7 @@ int mkpath_np(const char* path, mode_t mode) {
     // relative path whose working directory is gone, or a vanished root.
     if (from == 0) return ENOENT;
     std::string prefix = p.substr(0, ends[from - 1]);
-    if (mkdir(prefix.c_str(), mode) == 0) break;
+    if (mut::mkdir(prefix.c_str(), mode) == 0) break;
     err = errno;
     if (err == EEXIST) {
       if (int standing = intermediateStanding(prefix); standing != 0) return standing;
@@ -87,7 +89,7 @@ int mkpath_np(const char* path, mode_t mode) {
   for (size_t i = from; i <= ends.size(); ++i) {
     const bool last = i == ends.size();
     std::string prefix = last ? p : p.substr(0, ends[i]);
-    if (mkdir(prefix.c_str(), mode) == 0) continue;
+    if (mut::mkdir(prefix.c_str(), mode) == 0) continue;
     err = errno;
     if (err != EEXIST) return err;
     if (last) return lastStanding(p);

@@ -38,6 +38,8 @@ constexpr ErrnoName kErrnoNames[] = {
     {"EIO", EIO},       {"ENOSPC", ENOSPC}, {"EACCES", EACCES},       {"EROFS", EROFS},   {"EXDEV", EXDEV},
     {"ENOTEMPTY", ENOTEMPTY}, {"EPERM", EPERM}, {"ENOENT", ENOENT}, {"EEXIST", EEXIST}, {"EDQUOT", EDQUOT},
     {"EMFILE", EMFILE}, {"ENAMETOOLONG", ENAMETOOLONG}, {"EBUSY", EBUSY}, {"EINTR", EINTR},
+    {"ENOTDIR", ENOTDIR}, {"EISDIR", EISDIR}, {"ELOOP", ELOOP},   {"EINVAL", EINVAL}, {"EFBIG", EFBIG},
+    {"ENOMEM", ENOMEM}, {"EAGAIN", EAGAIN}, {"EOPNOTSUPP", EOPNOTSUPP}, {"ENODATA", ENODATA}, {"ERANGE", ERANGE},
 };
 
 // What to do, at which ordinal, to which kinds of operation.
@@ -76,17 +78,19 @@ bool parsePlan(std::string_view spec, Plan* plan) {
   if (!rest.empty()) {
     if (rest.front() != ':') return false;
     rest.remove_prefix(1);
+    // One or more names, each followed by a comma but the last: an empty
+    // name anywhere ("::", "rename,", ",rename") is refused.
     parsed.kinds = 0;
-    while (!rest.empty()) {
+    for (;;) {
       const size_t comma = rest.find(',');
       const std::string_view name = rest.substr(0, comma);
       size_t index = 0;
       while (index < kKindNames.size() && kKindNames[index] != name) ++index;
       if (index == kKindNames.size()) return false;
       parsed.kinds |= 1u << index;
-      rest = comma == std::string_view::npos ? std::string_view() : rest.substr(comma + 1);
+      if (comma == std::string_view::npos) break;
+      rest.remove_prefix(comma + 1);
     }
-    if (parsed.kinds == 0) return false;
   }
   *plan = parsed;
   return true;
@@ -110,6 +114,12 @@ State& state() {
     }
     if (const char* path = ::getenv("STOWLINE_FAULT_TRACE"); path && *path) {
       s->trace = UniqueFd(::open(path, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
+      if (!s->trace) {
+        const int openErrno = errno;
+        std::fprintf(stderr, "stowline: STOWLINE_FAULT_TRACE=\"%s\" cannot be opened: %s\n", path,
+                     std::strerror(openErrno));
+        std::abort();
+      }
     }
     return s;
   }();

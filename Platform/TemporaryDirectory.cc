@@ -8,6 +8,7 @@
 #include <cstdlib>
 #include <string>
 
+#include "Platform/Mutations.h"
 #include "Platform/SystemRoot.h"
 #include "Platform/UniqueFd.h"
 
@@ -31,11 +32,11 @@ URL perProcessTemporaryDirectory() {
 
   const std::string path = pathBelowSystemRoot("/tmp");
   UniqueFd root(::open(systemRoot().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (root && ::mkdirat(root.get(), "tmp", kSharedTemporaryMode) == 0) {
+  if (root && mut::mkdirat(root.get(), "tmp", kSharedTemporaryMode) == 0) {
     // mkdir applied the umask: the full mode is set on the new directory
     // itself, through a descriptor, never through a link put in its place.
     UniqueFd made(::openat(root.get(), "tmp", O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-    if (made) (void)::fchmod(made.get(), kSharedTemporaryMode);
+    if (made) (void)mut::fchmod(made.get(), kSharedTemporaryMode);
   }
   // EEXIST: whatever stands there already is used as it is.
   return URL::fileURLWithPath(path, true);

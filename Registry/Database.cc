@@ -1,6 +1,7 @@
 #include "Registry/Database.h"
 
 #include "Platform/Format.h"
+#include "Registry/CountedVfs.h"
 #include "Registry/EmbeddedRegistry.h"
 #include "Support/Errors.h"
 
@@ -21,7 +22,7 @@ sl::Error sqliteError(sqlite3* db, int code, std::string_view what) {
 std::optional<Database> Database::open(const std::string& path, sl::Error* error) {
   sqlite3* raw = nullptr;
   const int rc = sqlite3_open_v2(path.c_str(), &raw, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX,
-                                 nullptr);
+                                 countedVfsName());
   UniqueSqlite db(raw);  // a handle is returned even when the open fails
   if (rc != SQLITE_OK) {
     sl::fail(error, sqliteError(db.get(), rc, "open of " + path));

@@ -112,10 +112,6 @@ class EmbeddedRegistry : public RGApplicationWorkspace,
   // Every recorded safe harbor, in identifier order.
   std::vector<SafeHarbor> safeHarbors();
 
-  // Test seam: with k > 0, the k-th file-system or commit step counted from
-  // now ends the process with _exit(77) just before it runs. 0 disables.
-  static void setCrashStepForTesting(int k);
-
   // The data container of an application, made (and recorded) on first
   // request for a built-in one; empty when unknown. Used by the proxies.
   std::string dataContainerForIdentifier(const std::string& identifier);
@@ -156,9 +152,6 @@ namespace rg {
 // A new random container name, 8-4-4-4-12 uppercase hex; empty when
 // /dev/urandom cannot be read.
 std::string makeUUID();
-
-// Counts one step for the crash seam (see setCrashStepForTesting).
-void crashPoint();
 
 // Dot-separated numeric version comparison: <0, 0, >0. Missing components
 // count as 0, and the numeric prefix of each component is compared.

@@ -45,7 +45,6 @@ std::optional<OperationRow> loadOperation(rg::Database& db, int64_t operation, s
 }
 
 bool deleteOperation(rg::Database& db, int64_t operation, sl::Error* error) {
-  rg::crashPoint();
   std::optional<rg::Statement> statement = db.prepare("DELETE FROM operations WHERE id = ?", error);
   return statement && statement->bind(1, operation).run(error);
 }
@@ -54,7 +53,6 @@ bool deleteOperation(rg::Database& db, int64_t operation, sl::Error* error) {
 // containers root; this refuses anything else before a tree is removed.
 bool removeRecorded(const std::string& path, sl::Error* error) {
   if (path.empty() || path == "/") return true;
-  rg::crashPoint();
   return rg::removeTree(path, error);
 }
 

@@ -32,7 +32,7 @@ pthread_mutex_t gCrashReportLock = PTHREAD_MUTEX_INITIALIZER;
 
 void writeAll(int fd, const char* bytes, size_t length) {
   while (length > 0) {
-    ssize_t n = ::write(fd, bytes, length);
+    ssize_t n = ::write(fd, bytes, length);  // not counted: the crash report to stderr
     if (n < 0 && errno == EINTR) continue;
     if (n <= 0) return;  // nowhere else to report it
     bytes += n;
