@@ -11,9 +11,11 @@
 #include <string>
 
 #include "FileManager/SLFileManager.h"
+#include "Platform/AtomicFile.h"
 #include "Platform/Copyfile.h"
 #include "Platform/DataProtection.h"
 #include "Platform/Mkpath.h"
+#include "Platform/Mutations.h"
 #include "Platform/UniqueFd.h"
 #include "Support/Errors.h"
 #include "Support/Log.h"
@@ -51,7 +53,7 @@ bool SLFileManager::createDirectoryAtURL(const sl::URL& url, bool withIntermedia
       return sl::fail(error, _CreateError(kFunctionName, __LINE__, sl::kPOSIXErrorDomain, result,
                                           "mkpath_np of %@ failed: %s", pathString, strerror(result)));
     }
-  } else if (::mkdir(path, mode) != 0) {
+  } else if (sl::mut::mkdir(path, mode) != 0) {
     int mkdirErrno = errno;
     // Whatever already stands at the path, directory or not, is accepted
     // here; a non-directory is only caught below, when a class is to be set.
@@ -134,7 +136,18 @@ bool SLFileManager::_moveItemAtURL(const sl::URL& source, const sl::URL& destina
   }
 
   // On one volume a move is this one rename, whatever the size of the tree.
-  if (::rename(source.fileSystemRepresentation(), destination.fileSystemRepresentation()) == 0) return true;
+  // It is durable once both directories are flushed: what the caller does
+  // next (delete the old container, record the move) may depend on it.
+  if (sl::mut::rename(source.fileSystemRepresentation(), destination.fileSystemRepresentation()) == 0) {
+    sl::Error syncError;
+    if (!sl::syncParentDirectory(destination.path(), &syncError) ||
+        !sl::syncParentDirectory(source.path(), &syncError)) {
+      return sl::fail(error, _CreateError(kFunctionName, __LINE__, sl::kPOSIXErrorDomain, syncError.code(),
+                                          "rename of %@ to %@ is not durable: %@", source, destination,
+                                          syncError.localizedDescription()));
+    }
+    return true;
+  }
   int renameErrno = errno;
   // Only a different volume falls back to copying; every other refusal is
   // the move's failure.
@@ -147,6 +160,13 @@ bool SLFileManager::_moveItemAtURL(const sl::URL& source, const sl::URL& destina
   // The source was there a moment ago: a source gone now is a failure.
   // The copy's own record is the move's.
   if (!_copyItemAtURL(source, destination, true, error)) return false;
+  // The copy must be whole on disk before its source goes.
+  sl::Error syncError;
+  if (!sl::syncTree(destination.path(), &syncError) || !sl::syncParentDirectory(destination.path(), &syncError)) {
+    return sl::fail(error, _CreateError(kFunctionName, __LINE__, sl::kPOSIXErrorDomain, syncError.code(),
+                                        "copy of %@ to %@ is not durable: %@", source, destination,
+                                        syncError.localizedDescription()));
+  }
 
   // The item is at the destination, so the move has succeeded; a source
   // that cannot be removed stays behind and is only logged.
@@ -167,7 +187,7 @@ sl::URL SLFileManager::createTemporaryDirectoryInDirectoryURL(const sl::URL& par
   // mkdtemp fills the six X's in place, so it gets a private, writable copy
   // of the path (which carries no trailing separator).
   std::string path = templateURL.path();
-  if (::mkdtemp(path.data()) == nullptr) {
+  if (sl::mut::mkdtemp(path.data()) == nullptr) {
     int tempErrno = errno;
     const sl::Dictionary userInfo{{SLPathArgumentErrorKey, templateURL}};
     // Made (and so logged) whether or not the caller wants the record.

@@ -9,8 +9,10 @@
 #include <cerrno>
 #include <cstring>
 #include <string>
+#include <vector>
 
 #include "Platform/Format.h"
+#include "Platform/Mutations.h"
 #include "Platform/UniqueFd.h"
 
 namespace sl {
@@ -53,7 +55,7 @@ class TemporaryFile {
   ~TemporaryFile() {
     if (dirFd_ < 0) return;
     int saved = errno;
-    ::unlinkat(dirFd_, name_.c_str(), 0);
+    mut::unlinkat(dirFd_, name_.c_str(), 0);
     errno = saved;
   }
   TemporaryFile(const TemporaryFile&) = delete;
@@ -64,6 +66,33 @@ class TemporaryFile {
   int dirFd_;
   std::string name_;
 };
+
+// Temporary files of earlier writes of `name` that never reached their
+// rename (the process was killed between open and rename): ".<name>.XXXXXX"
+// regular files. They are removed once the new content is in place, so
+// that a file rewritten after a crash leaves nothing beside it. Failures
+// are ignored: the write itself has succeeded.
+void removeStaleTemporaries(int dirFd, const std::string& name) {
+  const std::string prefix = "." + name.substr(0, NAME_MAX - 8) + ".";
+  std::vector<std::string> stale;
+  {
+    UniqueFd copy(::openat(dirFd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    UniqueDir listing = copy ? fdopendir(copy) : UniqueDir();
+    if (!listing) return;
+    while (const struct dirent* entry = ::readdir(listing.get())) {
+      const std::string entryName = entry->d_name;
+      if (entryName.size() == prefix.size() + 6 && entryName.compare(0, prefix.size(), prefix) == 0) {
+        stale.push_back(entryName);
+      }
+    }
+  }
+  for (const std::string& entryName : stale) {
+    struct stat st;
+    if (::fstatat(dirFd, entryName.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0 && S_ISREG(st.st_mode)) {
+      (void)mut::unlinkat(dirFd, entryName.c_str(), 0);
+    }
+  }
+}
 
 }  // namespace
 
@@ -85,7 +114,7 @@ bool writeFileAtomically(const URL& url, std::span<const uint8_t> bytes, mode_t 
   int openErrno = 0;
   for (int attempt = 0; attempt < 100 && !fd; ++attempt) {
     tempName = temporaryName(name);
-    fd = UniqueFd(::openat(dir.get(), tempName.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
+    fd = UniqueFd(mut::openat(dir.get(), tempName.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
     openErrno = errno;
     if (!fd && openErrno != EEXIST) break;
   }
@@ -95,7 +124,7 @@ bool writeFileAtomically(const URL& url, std::span<const uint8_t> bytes, mode_t 
 
   size_t done = 0;
   while (done < bytes.size()) {
-    ssize_t n = ::write(fd.get(), bytes.data() + done, bytes.size() - done);
+    ssize_t n = mut::write(fd.get(), bytes.data() + done, bytes.size() - done);
     if (n < 0) {
       int e = errno;
       if (e == EINTR) continue;
@@ -105,13 +134,13 @@ bool writeFileAtomically(const URL& url, std::span<const uint8_t> bytes, mode_t 
     done += static_cast<size_t>(n);
   }
   // fchmod is not subject to the umask, so the file gets exactly `mode`.
-  if (::fchmod(fd.get(), mode) != 0) return failStep(error, errno, "fchmod", tempPath);
-  if (::fsync(fd.get()) != 0) return failStep(error, errno, "fsync", tempPath);
+  if (mut::fchmod(fd.get(), mode) != 0) return failStep(error, errno, "fchmod", tempPath);
+  if (mut::fsync(fd.get()) != 0) return failStep(error, errno, "fsync", tempPath);
   if (::close(fd.release()) != 0) return failStep(error, errno, "close", tempPath);
 
   // rename replaces a symbolic link at the destination with the file; it
   // never writes through it.
-  if (::renameat(dir.get(), tempName.c_str(), dir.get(), name.c_str()) != 0) {
+  if (mut::renameat(dir.get(), tempName.c_str(), dir.get(), name.c_str()) != 0) {
     int e = errno;
     if (error) *error = Error::posix(e, format("rename of %s to %s failed: %s", tempPath, path, errnoText(e)));
     return false;
@@ -120,8 +149,78 @@ bool writeFileAtomically(const URL& url, std::span<const uint8_t> bytes, mode_t 
 
   // Makes the rename durable. Some file systems cannot flush a directory
   // (EINVAL): the rename then stands as the file system keeps it.
-  if (::fsync(dir.get()) != 0 && errno != EINVAL) return failStep(error, errno, "fsync", dirPath);
+  if (mut::fsync(dir.get()) != 0 && errno != EINVAL) return failStep(error, errno, "fsync", dirPath);
+  removeStaleTemporaries(dir.get(), name);
   return true;
+}
+
+namespace {
+
+// Flushes the open `fd` (a file or a directory); EINVAL, a file system that
+// cannot flush it, is no failure.
+bool syncDescriptor(int fd, const std::string& path, Error* error) {
+  if (mut::fsync(fd) != 0) {
+    const int syncErrno = errno;
+    if (syncErrno != EINVAL) return failStep(error, syncErrno, "fsync", path);
+  }
+  return true;
+}
+
+// Flushes what `fd` (open on `path`) holds, then `fd` itself.
+bool syncTreeAt(int fd, const std::string& path, int depth, Error* error) {
+  struct stat st;
+  if (::fstat(fd, &st) != 0) return failStep(error, errno, "fstat", path);
+  if (S_ISDIR(st.st_mode)) {
+    if (depth > 256) return failStep(error, ELOOP, "walk", path);
+    std::vector<std::string> names;
+    {
+      UniqueFd copy(::openat(fd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+      if (!copy) return failStep(error, errno, "open", path);
+      UniqueDir dir = fdopendir(copy);
+      if (!dir) return failStep(error, errno, "opendir", path);
+      while (const struct dirent* entry = ::readdir(dir.get())) {
+        const std::string name = entry->d_name;
+        if (name != "." && name != "..") names.push_back(name);
+      }
+    }
+    for (const std::string& name : names) {
+      const std::string child = path + "/" + name;
+      struct stat childStat;
+      if (::fstatat(fd, name.c_str(), &childStat, AT_SYMLINK_NOFOLLOW) != 0) return failStep(error, errno, "stat", child);
+      if (!S_ISDIR(childStat.st_mode) && !S_ISREG(childStat.st_mode)) continue;  // links, fifos, devices
+      UniqueFd childFd(::openat(fd, name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+      if (!childFd) return failStep(error, errno, "open", child);
+      if (!syncTreeAt(childFd.get(), child, depth + 1, error)) return false;
+    }
+  }
+  return syncDescriptor(fd, path, error);
+}
+
+}  // namespace
+
+bool syncDirectory(const std::string& path, Error* error) {
+  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!fd) return failStep(error, errno, "open", path);
+  return syncDescriptor(fd.get(), path, error);
+}
+
+bool syncParentDirectory(const std::string& path, Error* error) {
+  std::string parent = path;
+  while (parent.size() > 1 && parent.back() == '/') parent.pop_back();
+  const size_t slash = parent.rfind('/');
+  if (slash == std::string::npos) return true;
+  parent.resize(slash == 0 ? 1 : slash);
+  return syncDirectory(parent, error);
+}
+
+bool syncTree(const std::string& path, Error* error) {
+  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+  if (!fd) {
+    const int openErrno = errno;
+    if (openErrno == ELOOP) return true;  // a link: nothing of its own to flush
+    return failStep(error, openErrno, "open", path);
+  }
+  return syncTreeAt(fd.get(), path, 0, error);
 }
 
 }  // namespace sl

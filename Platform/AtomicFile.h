@@ -19,6 +19,7 @@
 
 #include <cstdint>
 #include <span>
+#include <string>
 
 #include "Platform/Error.h"
 #include "Platform/URL.h"
@@ -34,5 +35,20 @@ namespace sl {
 // through.
 bool writeFileAtomically(const URL& url, std::span<const uint8_t> bytes, mode_t mode = 0644,
                          Error* error = nullptr);
+
+// Durability of changes made by other means (renames, new directories,
+// copies). Each flushes with fsync and treats a file system that cannot
+// flush a directory (EINVAL) as success; on failure it returns false with a
+// POSIX record "<step> of <path> failed: <strerror>" (step open or fsync).
+//
+// syncDirectory: the entries of the directory at `path` (names made,
+// renamed or removed in it). syncParentDirectory: those of the directory
+// that holds `path` (nothing is done for a path without a parent).
+// syncTree: every file and directory of the tree at `path`, deepest first,
+// links neither followed nor flushed; for a copy that must be whole on disk
+// before it is renamed into place or its source is removed.
+bool syncDirectory(const std::string& path, Error* error = nullptr);
+bool syncParentDirectory(const std::string& path, Error* error = nullptr);
+bool syncTree(const std::string& path, Error* error = nullptr);
 
 }  // namespace sl

@@ -6,13 +6,13 @@
 #include <fcntl.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <map>
 
 #include "FileManager/SLFileManager.h"
+#include "Platform/AtomicFile.h"
 #include "Platform/UniqueFd.h"
 #include "Support/Errors.h"
 #include "Support/Log.h"
@@ -26,7 +26,9 @@ constexpr char kCatalogueBundleURLKey[] = "com.vantor.Stowline.bundleURL";
 // by identifier; app_groups links them to applications. operations,
 // operation_paths and operation_moves hold the intent of installs in flight
 // (see EmbeddedRegistry.h); completed_installs remembers finished calls so
-// that a repeated one does nothing.
+// that a repeated one does nothing; refused_installs remembers packages
+// refused because a built-in application is not older, so that a repeated
+// call whose package was half consumed gets the same refusal.
 constexpr char kSchema[] = R"sql(
 CREATE TABLE IF NOT EXISTS applications(
   identifier TEXT PRIMARY KEY,
@@ -57,6 +59,10 @@ CREATE TABLE IF NOT EXISTS operation_moves(
   source TEXT NOT NULL,
   destination TEXT NOT NULL,
   PRIMARY KEY(operation, seq));
+CREATE TABLE IF NOT EXISTS refused_installs(
+  package_path TEXT NOT NULL,
+  identifier TEXT NOT NULL,
+  PRIMARY KEY(package_path, identifier));
 CREATE TABLE IF NOT EXISTS completed_installs(
   package_path TEXT NOT NULL,
   identifier TEXT NOT NULL,
@@ -66,8 +72,6 @@ CREATE TABLE IF NOT EXISTS safe_harbors(
   path TEXT NOT NULL,
   container_type INTEGER NOT NULL);
 )sql";
-
-std::atomic<int> gCrashStep{0};
 
 // The parent of a directory URL's path, as a path.
 std::string parentPath(const sl::URL& url) { return url.URLByDeletingLastPathComponent().path(); }
@@ -101,13 +105,6 @@ std::string makeUUID() {
   return text;
 }
 
-void crashPoint() {
-  const int k = gCrashStep.load();
-  if (k <= 0) return;
-  if (k == 1) ::_exit(77);
-  gCrashStep.store(k - 1);
-}
-
 int compareVersions(const std::string& a, const std::string& b) {
   auto component = [](const std::string& text, size_t& position) -> unsigned long long {
     unsigned long long value = 0;
@@ -133,8 +130,6 @@ int compareVersions(const std::string& a, const std::string& b) {
 }
 
 }  // namespace rg
-
-void EmbeddedRegistry::setCrashStepForTesting(int k) { gCrashStep.store(k); }
 
 EmbeddedRegistry::EmbeddedRegistry(SLGlobalConfiguration& configuration, rg::Database db)
     : configuration_(configuration), db_(std::move(db)) {}
@@ -268,6 +263,11 @@ std::string EmbeddedRegistry::dataContainerForIdentifier(const std::string& iden
           SLLog(sl::kLogLevelError, kFunctionName, "Failed to make the data container of %s: %@", identifier, error);
           return {};
         }
+      }
+      // Data is moved into it next: its entry must be on disk first.
+      if (!sl::syncDirectory(record->dataContainer, &error) || !sl::syncDirectory(dataRoot_, &error)) {
+        SLLog(sl::kLogLevelError, kFunctionName, "Failed to make the data container of %s: %@", identifier, error);
+        return {};
       }
     }
   }

@@ -9,6 +9,7 @@
 #include <set>
 
 #include "FileManager/SLFileManager.h"
+#include "Platform/AtomicFile.h"
 #include "Platform/Bundle.h"
 #include "Platform/Copyfile.h"
 #include "Registry/EmbeddedRegistry.h"
@@ -53,6 +54,24 @@ bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Diction
                                 {RGProgressErrorDetailKey, sl::String(packagePath)}});
     }
     return sl::fail(error, record);
+  };
+
+  // A package refused because a built-in application is not older is
+  // remembered before it is consumed. When that consumption was cut short
+  // (the process killed while the package was being removed), the same call
+  // finds a package without its application and gets the same answer, so
+  // that a resumed migration hears what the first call would have said.
+  auto refusedAsAlreadyInstalled = [&](const std::string& identifierText) {
+    if (configuration_.systemAppBundleIDToInfoMap().get(identifierText).asDictionary().isNull()) return false;
+    std::optional<rg::Statement> earlier =
+        db_.prepare("SELECT 1 FROM refused_installs WHERE package_path = ? AND identifier = ?", nullptr);
+    return earlier && earlier->bind(1, packagePath).bind(2, identifierText).step(nullptr);
+  };
+  auto refuseAgain = [&](const std::string& identifierText) {
+    return refuse(RGErrorApplicationAlreadyInstalled,
+                  _CreateError(kFunctionName, __LINE__, RGErrorDomain, kRGAlreadyInstalledError,
+                               "The package %s for %s was refused before: the built-in application is not older",
+                               packagePath, identifierText));
   };
 
   report(0, "Validating");
@@ -136,6 +155,7 @@ bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Diction
       }
     }
     if (bundlePath.empty()) {
+      if (refusedAsAlreadyInstalled(identifier)) return refuseAgain(identifier);
       return refuse(kRGProgressErrorInvalidPackage,
                     _CreateError(kFunctionName, __LINE__, RGErrorDomain, kRGInvalidPackageError,
                                  "Package %s holds no application in Payload", packagePath));
@@ -154,6 +174,7 @@ bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Diction
   const std::shared_ptr<sl::Bundle> bundle = sl::Bundle::createUnique(sl::URL::fileURLWithPath(bundlePath, true));
   const sl::Dictionary info = bundle ? bundle->infoDictionary() : sl::Dictionary();
   if (info.isNull()) {
+    if (!placeholder && refusedAsAlreadyInstalled(identifier)) return refuseAgain(identifier);
     return refuse(kRGProgressErrorInvalidPackage,
                   _CreateError(kFunctionName, __LINE__, RGErrorDomain, kRGInvalidPackageError,
                                "No readable Info.plist in bundle %s", bundlePath));
@@ -180,6 +201,11 @@ bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Diction
     const std::string builtInVersion = builtIn.get(kCatalogueBundleVersionKey).asString().str();
     const std::string packageVersion = info.get(kBundleVersionKey).asString().str();
     if (rg::compareVersions(builtInVersion, packageVersion) >= 0) {
+      std::optional<rg::Statement> remember = db_.prepare(
+          "INSERT OR IGNORE INTO refused_installs(package_path, identifier) VALUES(?, ?)", &dbError);
+      if (!remember || !remember->bind(1, packagePath).bind(2, identifier).run(&dbError)) {
+        return refuse(kRGProgressErrorInstallFailed, dbError);
+      }
       return refuse(RGErrorApplicationAlreadyInstalled,
                     _CreateError(kFunctionName, __LINE__, RGErrorDomain, kRGAlreadyInstalledError,
                                  "The built-in %s has version %s, not older than the package's %s", identifier,
@@ -264,7 +290,6 @@ bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Diction
         return refuse(kRGProgressErrorInstallFailed, dbError);
       }
     }
-    rg::crashPoint();
     if (!transaction.commit(&dbError)) return refuse(kRGProgressErrorInstallFailed, dbError);
   }
 
@@ -289,7 +314,6 @@ bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Diction
   };
   sl::Error fsError;
   auto makeDirectory = [&](const std::string& directory) {
-    rg::crashPoint();
     return fm.createDirectoryAtURL(sl::URL::fileURLWithPath(directory, true), false, 0755, &fsError);
   };
   report(30, "Installing");
@@ -309,11 +333,26 @@ bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Diction
   const sl::URL installedBundleURL = sl::URL::fileURLWithPath(installedBundle, true);
   sl::Number installType = withOptions.get(RGInstallTypeKey).asNumber();
   if (installType.isNull()) installType = sl::Number(0);
-  rg::crashPoint();
   if (!fm.setInstallType(installType, installedBundleURL, &fsError)) return abandon(fsError);
   if (placeholder) {
-    rg::crashPoint();
     if (!fm.markBundleAsPlaceholder(installedBundleURL, &fsError)) return abandon(fsError);
+  }
+
+  // Everything the new state records is on disk before it is committed:
+  // the containers made above, their entries, and the installed bundle's
+  // attributes (the moves flushed their own directories). After the
+  // commit the package may go.
+  {
+    std::vector<std::string> durable = {bundleRoot_, bundleContainer, installedBundle};
+    if (newDataContainer) {
+      durable.insert(durable.end(), {dataRoot_, dataContainer});
+    }
+    bool newGroup = false;
+    for (const PlannedGroup& group : groups) newGroup = newGroup || group.isNew;
+    if (newGroup) durable.push_back(groupRoot_);
+    for (const std::string& directory : durable) {
+      if (!sl::syncDirectory(directory, &fsError)) return abandon(fsError);
+    }
   }
 
   // ---- 4. The new state ----
@@ -343,10 +382,7 @@ bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Diction
     }
     run("INSERT OR IGNORE INTO completed_installs(package_path, identifier) VALUES(?, ?)", {packagePath, identifier});
     run("UPDATE operations SET done = 1 WHERE id = ?", {std::to_string(operation)});
-    if (ok) {
-      rg::crashPoint();
-      ok = transaction.commit(&dbError);
-    }
+    if (ok) ok = transaction.commit(&dbError);
     if (!ok) return abandon(dbError);
   }
 

@@ -7,7 +7,9 @@
 #include <cstring>
 
 #include "FileManager/SLFileManager.h"
+#include "Platform/AtomicFile.h"
 #include "Platform/Copyfile.h"
+#include "Platform/Mutations.h"
 #include "Platform/URL.h"
 #include "Registry/EmbeddedRegistry.h"
 #include "Support/Errors.h"
@@ -34,7 +36,7 @@ bool present(const std::string& path) {
 }
 
 bool renameItem(const std::string& from, const std::string& to, int* failedErrno) {
-  if (::rename(from.c_str(), to.c_str()) == 0) return true;
+  if (sl::mut::rename(from.c_str(), to.c_str()) == 0) return true;
   *failedErrno = errno;
   return false;
 }
@@ -44,19 +46,33 @@ bool posixFailure(sl::Error* error, int code, const char* call, const std::strin
                                       call, from, to, strerror(code)));
 }
 
-// Copies `from` to a temporary name in `directory`, then renames it to `to`.
+// Flushes the directories of both ends of a rename, so that it is on disk
+// before anything that depends on it (the commit that records it, the
+// removal of what it replaced).
+bool syncRenamed(const std::string& from, const std::string& to, sl::Error* error) {
+  sl::Error syncError;
+  if (sl::syncParentDirectory(to, &syncError) && sl::syncParentDirectory(from, &syncError)) return true;
+  return sl::fail(error, _CreateError(kFunctionName, __LINE__, sl::kPOSIXErrorDomain, syncError.code(),
+                                      "rename of %s to %s is not durable: %@", from, to,
+                                      syncError.localizedDescription()));
+}
+
+// Copies `from` to a temporary name in `directory`, flushes the copy, then
+// renames it to `to`.
 bool copyThenRename(const std::string& from, const std::string& to, const char* suffix, sl::Error* error) {
   const std::string temporary = besideWithPrefix(to, parentOf(to), suffix);
-  crashPoint();
   if (!removeTree(temporary, error)) return false;
   if (sl::copyfile(from.c_str(), temporary.c_str(), nullptr, kCopyFlags) != 0) {
     const int copyErrno = errno;
     return posixFailure(error, copyErrno, "copyfile", from, temporary);
   }
-  crashPoint();
+  sl::Error syncError;
+  if (!sl::syncTree(temporary, &syncError)) {
+    return posixFailure(error, static_cast<int>(syncError.code()), "fsync of the copy", from, temporary);
+  }
   int renameErrno = 0;
   if (!renameItem(temporary, to, &renameErrno)) return posixFailure(error, renameErrno, "rename", temporary, to);
-  return true;
+  return syncRenamed(temporary, to, error);
 }
 
 }  // namespace
@@ -71,17 +87,15 @@ bool removeTree(const std::string& path, sl::Error* error) {
 }
 
 bool moveIntoContainer(const Move& move, sl::Error* error) {
-  crashPoint();
   int renameErrno = 0;
-  if (renameItem(move.source, move.destination, &renameErrno)) return true;
+  if (renameItem(move.source, move.destination, &renameErrno)) return syncRenamed(move.source, move.destination, error);
   if (renameErrno != EXDEV) return posixFailure(error, renameErrno, "rename", move.source, move.destination);
   if (!copyThenRename(move.source, move.destination, ".partial", error)) return false;
   // The source leaves whole or not at all: renamed away first, then removed.
   const std::string trash = trashPathFor(move.source);
-  crashPoint();
   if (!removeTree(trash, error)) return false;
   if (!renameItem(move.source, trash, &renameErrno)) return posixFailure(error, renameErrno, "rename", move.source, trash);
-  crashPoint();
+  if (!syncRenamed(move.source, trash, error)) return false;
   return removeTree(trash, error);
 }
 
@@ -91,6 +105,8 @@ bool undoMove(const Move& move, sl::Error* error) {
     if (!renameItem(move.destination, move.source, &renameErrno)) {
       if (renameErrno != EXDEV) return posixFailure(error, renameErrno, "rename", move.destination, move.source);
       if (!copyThenRename(move.destination, move.source, ".rgrestore", error)) return false;
+    } else if (!syncRenamed(move.destination, move.source, error)) {
+      return false;
     }
   }
   return removeTree(trashPathFor(move.source), error);

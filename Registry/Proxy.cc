@@ -18,7 +18,9 @@ class RegistryProxy final : public RGBundleProxy {
   sl::URL bundleURL() const override { return directoryURL(record_.bundlePath); }
   sl::URL bundleContainerURL() const override { return directoryURL(record_.bundleContainer); }
   sl::URL dataContainerURL() const override {
-    if (record_.dataContainer.empty()) {
+    // A built-in application's container is recorded before it is made: the
+    // registry makes it (again) when it is missing, so it is always asked.
+    if (record_.dataContainer.empty() || record_.type == "System") {
       if (const std::shared_ptr<EmbeddedRegistry> registry = registry_.lock()) {
         record_.dataContainer = registry->dataContainerForIdentifier(record_.identifier);
       }

@@ -10,6 +10,7 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/xattr.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -44,6 +45,7 @@ constexpr char kCommand[] = "fixture";
 constexpr char kUsage[] =
     "usage: stowline fixture --root DIR --apps N [--vpn-only M] [--groups G]\n"
     "                        [--files-per-app F] [--bytes-per-file B] [--seed S]\n"
+    "                        [--app-vpn V] [--placeholders P] [--builtin B]\n"
     "\n"
     "Writes an old layout below the system root DIR: N application containers\n"
     "(bundle, icon, data in Documents, Library, tmp and Tillbox, sometimes store\n"
@@ -60,7 +62,16 @@ constexpr char kUsage[] =
     "  --groups G            group containers (default 0)\n"
     "  --files-per-app F     data files per application (default 3)\n"
     "  --bytes-per-file B    size of each data file (default 64)\n"
-    "  --seed S              seed of the generator (default 1)\n";
+    "  --seed S              seed of the generator (default 1)\n"
+    "  --app-vpn V           the first V application containers also hold a VPN\n"
+    "                        plug-in, installed with the application (default 0)\n"
+    "  --placeholders P      containers whose bundle carries the placeholder\n"
+    "                        marker: migrate installs a placeholder for each and\n"
+    "                        moves its data, but no bundle (default 0)\n"
+    "  --builtin B           built-in applications below DIR/Applications, each\n"
+    "                        with an old container holding an older copy and\n"
+    "                        data: migrate moves the data into the built-in\n"
+    "                        application's data container (default 0)\n";
 
 // The access and modification time of every item written: 2021-01-01
 // 00:00:00 UTC.
@@ -85,6 +96,9 @@ struct Options {
   uint64_t filesPerApp = 3;
   uint64_t bytesPerFile = 64;
   uint64_t seed = 1;
+  uint64_t appVPN = 0;
+  uint64_t placeholders = 0;
+  uint64_t builtIn = 0;
 };
 
 // splitmix64: small, fast and the same on every platform.
@@ -165,6 +179,10 @@ class FixtureWriter {
   bool makeIcon();
   bool writeGroup(const Directory& groups, uint64_t index);
   bool writeApplication(const Directory& root, uint64_t index);
+  bool writeData(const Directory& container);
+  bool writePlaceholderContainer(const Directory& root, uint64_t index);
+  bool writeBuiltInApplication(const Directory& applications, const Directory& root, uint64_t index);
+  bool writeExtras();
   bool writeVPNContainer(const Directory& root, uint64_t index);
   bool writeHarbors();
   bool writeSystemVersion();
@@ -377,19 +395,24 @@ bool FixtureWriter::writeApplication(const Directory& root, uint64_t index) {
     return false;
   }
 
-  // The data, spread over the four data directories in turn.
-  std::array<Directory, kDataDirectories.size()> data;
-  for (size_t i = 0; i < data.size(); ++i) {
-    if (!makeDirectory(container, kDataDirectories[i], &data[i])) return false;
-  }
-  for (uint64_t f = 0; f < options_.filesPerApp; ++f) {
-    if (!writeRandomFile(data[f % data.size()], "file" + std::to_string(f) + ".dat", options_.bytesPerFile)) {
+  // A VPN plug-in beside the application, for the first --app-vpn
+  // containers. Nothing about it is drawn, so the rest of the tree is the
+  // same with or without it.
+  if (index <= options_.appVPN) {
+    Directory plugin;
+    const std::string pluginName = name + "Tunnel";
+    const sl::Dictionary pluginInfo{{"PBBundleIdentifier", sl::String(identifier + ".tunnel")},
+                                    {"PBBundleVersion", sl::String(version)},
+                                    {"PBBundleDisplayName", sl::String("Fixture Tunnel of App " + number)},
+                                    {"PBBundleExecutable", sl::String(pluginName)}};
+    if (!makeDirectory(container, pluginName + ".vpnplugin", &plugin) ||
+        !writePropertyList(plugin, "Info.plist", pluginInfo) ||
+        !writeFile(plugin, pluginName, bytesOf("#!/bin/sh\necho " + pluginName + "\n"), 0755) || !finish(plugin)) {
       return false;
     }
   }
-  for (Directory& directory : data) {
-    if (!finish(directory)) return false;
-  }
+
+  if (!writeData(container)) return false;
 
   // Store metadata beside the bundle: none, the metadata and artwork, or
   // all four items.
@@ -411,6 +434,98 @@ bool FixtureWriter::writeApplication(const Directory& root, uint64_t index) {
     }
   }
   return finish(container);
+}
+
+// The data of one application, spread over the four data directories in
+// turn.
+bool FixtureWriter::writeData(const Directory& container) {
+  std::array<Directory, kDataDirectories.size()> data;
+  for (size_t i = 0; i < data.size(); ++i) {
+    if (!makeDirectory(container, kDataDirectories[i], &data[i])) return false;
+  }
+  for (uint64_t f = 0; f < options_.filesPerApp; ++f) {
+    if (!writeRandomFile(data[f % data.size()], "file" + std::to_string(f) + ".dat", options_.bytesPerFile)) {
+      return false;
+    }
+  }
+  for (Directory& directory : data) {
+    if (!finish(directory)) return false;
+  }
+  return true;
+}
+
+// An application that was only ever a placeholder: its bundle carries the
+// placeholder marker (4 bytes holding 1, little-endian), so migrate installs
+// a placeholder from its Info.plist and moves its data, but installs no
+// bundle.
+bool FixtureWriter::writePlaceholderContainer(const Directory& root, uint64_t index) {
+  const std::string number = std::to_string(index);
+  const std::string name = "Placeholder" + number;
+  const sl::Dictionary info{{"PBBundleIdentifier", sl::String("com.example.fixture.placeholder" + number)},
+                            {"PBBundleVersion", sl::String("1.0")},
+                            {"PBBundleShortVersionString", sl::String("1.0")},
+                            {"PBBundleDisplayName", sl::String("Fixture Placeholder " + number)},
+                            {"PBBundleExecutable", sl::String(name)}};
+  Directory container;
+  Directory bundle;
+  if (!makeDirectory(root, random_.uuid(), &container) || !makeDirectory(container, name + ".app", &bundle) ||
+      !writePropertyList(bundle, "Info.plist", info) || !writeFile(bundle, "Icon.png", icon_, 0644)) {
+    return false;
+  }
+  static constexpr uint8_t kPlaceholderValue[4] = {1, 0, 0, 0};
+  if (::fsetxattr(bundle.fd.get(), "user.com.vantor.stowd.placeholder", kPlaceholderValue, sizeof kPlaceholderValue,
+                  0) != 0) {
+    return fail("fsetxattr", bundle.path, errno);
+  }
+  return finish(bundle) && writeData(container) && finish(container);
+}
+
+// A built-in application (version 9.0, below the system's applications
+// directory) and an old container holding its older copy (1.0) with data:
+// the registry knows the identifier from the start and refuses the old
+// copy as already installed, after the data has moved.
+bool FixtureWriter::writeBuiltInApplication(const Directory& applications, const Directory& root, uint64_t index) {
+  const std::string number = std::to_string(index);
+  const std::string name = "BuiltIn" + number;
+  auto info = [&](const char* version) {
+    return sl::Dictionary{{"PBBundleIdentifier", sl::String("com.example.fixture.builtin" + number)},
+                          {"PBBundleVersion", sl::String(version)},
+                          {"PBBundleShortVersionString", sl::String(version)},
+                          {"PBBundleDisplayName", sl::String("Fixture Built-in " + number)},
+                          {"PBBundleExecutable", sl::String(name)}};
+  };
+  const std::string executable = "#!/bin/sh\necho " + name + "\n";
+  Directory system;
+  if (!makeDirectory(applications, name + ".app", &system) || !writePropertyList(system, "Info.plist", info("9.0")) ||
+      !writeFile(system, name, bytesOf(executable), 0755) || !finish(system)) {
+    return false;
+  }
+  Directory container;
+  Directory bundle;
+  return makeDirectory(root, random_.uuid(), &container) && makeDirectory(container, name + ".app", &bundle) &&
+         writePropertyList(bundle, "Info.plist", info("1.0")) &&
+         writeFile(bundle, name, bytesOf(executable), 0755) && finish(bundle) && writeData(container) &&
+         finish(container);
+}
+
+// Placeholders and built-in applications come after everything else, so
+// that the rest of the tree is the same whether or not they are asked for.
+bool FixtureWriter::writeExtras() {
+  if (options_.placeholders == 0 && options_.builtIn == 0) return true;
+  Directory root;
+  if (!openPath(oldContainerPath_, &root)) return false;
+  for (uint64_t p = 1; p <= options_.placeholders; ++p) {
+    if (!writePlaceholderContainer(root, p)) return false;
+  }
+  if (options_.builtIn > 0) {
+    Directory applications;
+    if (!openPath(sl::pathBelowSystemRoot("/Applications"), &applications)) return false;
+    for (uint64_t b = 1; b <= options_.builtIn; ++b) {
+      if (!writeBuiltInApplication(applications, root, b)) return false;
+    }
+    finishLater_.push_back(std::move(applications));
+  }
+  return true;
 }
 
 bool FixtureWriter::writeVPNContainer(const Directory& root, uint64_t index) {
@@ -501,7 +616,7 @@ int FixtureWriter::run() {
   }
   finishLater_.push_back(std::move(root));
 
-  if (!writeHarbors() || !writeMaps() || !writeSystemVersion()) return 1;
+  if (!writeHarbors() || !writeMaps() || !writeSystemVersion() || !writeExtras()) return 1;
   for (Directory& directory : finishLater_) {
     if (!finish(directory)) return 1;
   }
@@ -511,6 +626,13 @@ int FixtureWriter::run() {
       static_cast<unsigned long long>(options_.apps), static_cast<unsigned long long>(options_.vpnOnly),
       static_cast<unsigned long long>(options_.groups), static_cast<unsigned long long>(harborCount_),
       sl::systemRoot().c_str());
+  if (options_.appVPN > 0 || options_.placeholders > 0 || options_.builtIn > 0) {
+    std::printf("with %llu VPN plug-ins beside applications, %llu placeholder containers and %llu built-in "
+                "applications\n",
+                static_cast<unsigned long long>(std::min(options_.appVPN, options_.apps)),
+                static_cast<unsigned long long>(options_.placeholders),
+                static_cast<unsigned long long>(options_.builtIn));
+  }
   return 0;
 }
 
@@ -573,7 +695,10 @@ int fixtureCommand(Arguments args) {
                                {"--groups", &options.groups},
                                {"--files-per-app", &options.filesPerApp},
                                {"--bytes-per-file", &options.bytesPerFile},
-                               {"--seed", &options.seed}};
+                               {"--seed", &options.seed},
+                               {"--app-vpn", &options.appVPN},
+                               {"--placeholders", &options.placeholders},
+                               {"--builtin", &options.builtIn}};
     bool known = arg == "--root";
     for (const Counted& c : counted) known = known || arg == c.name;
     if (!known) return usageError(kCommand, "unknown option '" + std::string(arg) + "'");
