@@ -117,7 +117,9 @@ bool dataFromPropertyList(const Value& value, PropertyListFormat format, std::ve
 
 bool readFileContents(const URL& url, std::vector<uint8_t>* out, Error* error) {
   const std::string& path = url.path();
-  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  // O_NONBLOCK: a fifo planted where a file is expected must not hang the
+  // open (it is refused below); O_NOCTTY: a terminal never becomes ours.
+  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
   if (!fd) {
     int e = errno;
     return plist_detail::fail(error, e, format("open of %s failed: %s", path, errnoText(e)));
@@ -126,6 +128,15 @@ bool readFileContents(const URL& url, std::vector<uint8_t>* out, Error* error) {
   if (::fstat(fd.get(), &st) != 0) {
     int e = errno;
     return plist_detail::fail(error, e, format("fstat of %s failed: %s", path, errnoText(e)));
+  }
+  // Only regular files are read: a directory is refused as read(2) would
+  // refuse it, and a fifo, socket or device (which could block or never
+  // end) is not read at all.
+  if (S_ISDIR(st.st_mode)) {
+    return plist_detail::fail(error, EISDIR, format("read of %s failed: %s", path, errnoText(EISDIR)));
+  }
+  if (!S_ISREG(st.st_mode)) {
+    return plist_detail::fail(error, EINVAL, format("read of %s failed: not a regular file", path));
   }
   std::vector<uint8_t> bytes;
   // The size is a hint only: files of /proc and the like report 0, and a
