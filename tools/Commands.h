@@ -9,6 +9,9 @@
 #include <string>
 #include <string_view>
 
+#include "Platform/URL.h"
+#include "Platform/Value.h"
+
 namespace stowline {
 
 using Arguments = std::span<char* const>;
@@ -39,6 +42,28 @@ int setupError(std::string_view command, std::string_view message);
 // directory) before anything reads the configuration. Returns false with a
 // usage error printed when it is not a directory.
 bool applyRoot(std::string_view command, const std::string& root);
+
+// A migration marker of the old layout whose paths lie outside it. The
+// plug-in acts on a marker's paths as they stand (it writes into, moves out
+// of and finally removes its "ContainerPath"), so migrate checks every marker
+// before it loads the plug-in, and plan shows what that check finds.
+struct MarkerFinding {
+  std::string marker;  // the marker file
+  std::string key;     // "ContainerPath", "BundlePath" or "SecondBundlePath"
+  std::string path;    // the path the marker names under that key
+  std::string within;  // the directory that path must lie directly inside
+};
+
+// Checks the record read back from the marker at `marker`: its
+// "ContainerPath" must be a directory (not a link) directly inside
+// `containerRoot`, and "BundlePath" and "SecondBundlePath" (when present)
+// must name entries directly inside that container. nullopt when they do.
+// Defined in MigrateCommand.cc.
+std::optional<MarkerFinding> checkMarkerRecord(const sl::Dictionary& record, const sl::URL& marker,
+                                               const sl::URL& containerRoot);
+
+// "migration marker M names "K" P, which is not ... inside W".
+std::string describeMarkerFinding(const MarkerFinding& finding);
 
 inline constexpr char kVersion[] = "0.1.0";
 

@@ -3,9 +3,10 @@
 // follows migrationProgress (on a terminal only), and prints a summary.
 //
 // Everything the user can fix is checked before anything changes: the root,
-// the log file, the plug-in and its entry points. Only then is the registry
-// opened and the migrator made (its init may already delete an empty old
-// container root: that is the migration's own work).
+// the migration markers of the old layout, the log file, the plug-in and its
+// entry points. Only then is the registry opened and the migrator made (its
+// init may already delete an empty old container root: that is the
+// migration's own work).
 
 #include <dlfcn.h>
 #include <fcntl.h>
@@ -28,8 +29,12 @@
 #include <string>
 #include <string_view>
 #include <thread>
+#include <vector>
 
+#include "AppMigrator/Classification.h"
+#include "AppMigrator/OldLayout.h"
 #include "Configuration/SLGlobalConfiguration.h"
+#include "FileManager/SLFileManager.h"
 #include "Platform/ApplicationRegistry.h"
 #include "Platform/HostLog.h"
 #include "Platform/InstallerLibrary.h"
@@ -51,7 +56,7 @@ constexpr char kCommand[] = "migrate";
 constexpr char kHelp[] =
     "usage: stowline migrate [--root DIR] [--plugin PATH] [--log-file FILE]\n"
     "                        [--log-format text|jsonl] [--log-level error|notice|debug]\n"
-    "                        [--json] [--no-progress]\n"
+    "                        [--json] [--no-progress] [--trust-markers]\n"
     "\n"
     "Loads the migration plug-in and migrates the old layout below the root into\n"
     "the new one.\n"
@@ -65,10 +70,14 @@ constexpr char kHelp[] =
     "  --log-level LEVEL   error, notice (default) or debug\n"
     "  --json              print the summary as one JSON object\n"
     "  --no-progress       no progress bar, even on a terminal\n"
+    "  --trust-markers     use the migration markers of the old layout as they\n"
+    "                      stand, even those that name a container outside the old\n"
+    "                      container root or a bundle outside their container\n"
     "\n"
     "Exit status: 0 when the migration succeeded, 1 when it failed, 2 for a usage\n"
-    "error, a plug-in that cannot be loaded, a log file that cannot be opened or a\n"
-    "migrator that could not be made.\n";
+    "error, a migration marker that names paths outside the old layout, a plug-in\n"
+    "that cannot be loaded, a log file that cannot be opened or a migrator that\n"
+    "could not be made.\n";
 
 // The estimated duration is 20 plus 2.25 per item of the old container root.
 constexpr double kBaseDuration = 20.0;
@@ -82,6 +91,7 @@ struct Options {
   int logLevel = sl::kLogLevelNotice;
   bool json = false;
   bool noProgress = false;
+  bool trustMarkers = false;
 };
 
 // One line of the program's own on standard error; always 2.
@@ -138,6 +148,8 @@ std::optional<Options> parse(Arguments args, int* status) {
       options.json = true;
     } else if (arg == "--no-progress") {
       options.noProgress = true;
+    } else if (arg == "--trust-markers") {
+      options.trustMarkers = true;
     } else {
       *status = usageError(kCommand, "unknown option '" + std::string(arg) + "'");
       return std::nullopt;
@@ -370,6 +382,42 @@ uint64_t itemsFromProgress(float progress, uint64_t items) {
   return static_cast<uint64_t>(std::llround(share * static_cast<double>(items)));
 }
 
+// True when `item` names an entry directly inside `directory`: its parent
+// is that directory and its name is an ordinary one. Paths are compared as
+// written, as introspection writes them.
+bool isDirectChild(const sl::URL& item, const sl::URL& directory) {
+  if (item.isNull() || directory.isNull()) return false;
+  const std::string name = item.lastPathComponent();
+  if (name.empty() || name == "." || name == ".." || name == "/") return false;
+  return item.URLByDeletingLastPathComponent().path() == directory.path();
+}
+
+// The findings for every migration marker that introspection would take as
+// its container's record, in the order of the old container root's listing.
+// Only directories that hold something at the marker's name are classified;
+// links in the root are left out, as the migrator leaves them out (and the
+// listing that leaves them out would log each one). A root that is missing
+// or cannot be listed gives none: the migrator's init reports it.
+std::vector<MarkerFinding> untrustedMarkers() {
+  std::vector<MarkerFinding> findings;
+  const sl::URL containerRoot = SLGlobalConfiguration::sharedInstance().oldContainerPath();
+  const std::optional<std::vector<sl::URL>> entries =
+      SLFileManager::defaultManager().urlsForItemsInDirectoryAtURL(containerRoot, false, nullptr);
+  if (!entries) return findings;
+  for (const sl::URL& entry : *entries) {
+    struct stat st;
+    if (::lstat(entry.fileSystemRepresentation(), &st) != 0 || !S_ISDIR(st.st_mode)) continue;
+    const sl::URL marker = entry.URLByAppendingPathComponent(sl::migrator::kMigrationMarkerName, false);
+    if (::lstat(marker.fileSystemRepresentation(), &st) != 0) continue;
+    const sl::migrator::Decision decision = sl::migrator::classifyContainer(entry);
+    if (decision.kind != sl::migrator::DecisionKind::MarkerFound) continue;
+    if (std::optional<MarkerFinding> finding = checkMarkerRecord(decision.record, marker, containerRoot)) {
+      findings.push_back(std::move(*finding));
+    }
+  }
+  return findings;
+}
+
 bool wantsProgressBar(const Options& options) {
   if (options.noProgress || !::isatty(STDERR_FILENO)) return false;
   const char* noColor = std::getenv("NO_COLOR");
@@ -377,6 +425,36 @@ bool wantsProgressBar(const Options& options) {
 }
 
 }  // namespace
+
+std::optional<MarkerFinding> checkMarkerRecord(const sl::Dictionary& record, const sl::URL& marker,
+                                               const sl::URL& containerRoot) {
+  const auto pathOf = [&record](const char* key) {
+    const sl::String value = record.get(key).asString();
+    return value.isNull() ? std::string() : value.str();
+  };
+  const auto finding = [&](const char* key, const sl::URL& within) {
+    return MarkerFinding{marker.path(), key, pathOf(key), within.path()};
+  };
+  const sl::URL container = sl::URL::fileURLWithPath(pathOf(sl::migrator::kContainerPathKey), true);
+  struct stat st;
+  if (!isDirectChild(container, containerRoot) || ::lstat(container.fileSystemRepresentation(), &st) != 0 ||
+      !S_ISDIR(st.st_mode)) {
+    return finding(sl::migrator::kContainerPathKey, containerRoot);
+  }
+  // Bundles need not exist: a resumed run may have moved them away already.
+  for (const char* key : {sl::migrator::kBundlePathKey, sl::migrator::kSecondBundlePathKey}) {
+    if (std::string_view(key) == sl::migrator::kSecondBundlePathKey && !record.contains(key)) continue;
+    if (!isDirectChild(sl::URL::fileURLWithPath(pathOf(key), true), container)) return finding(key, container);
+  }
+  return std::nullopt;
+}
+
+std::string describeMarkerFinding(const MarkerFinding& finding) {
+  const bool isContainer = finding.key == sl::migrator::kContainerPathKey;
+  return "migration marker " + finding.marker + " names \"" + finding.key + "\" " + finding.path + ", which is not " +
+         (isContainer ? "a directory directly inside the old container root " : "directly inside its container ") +
+         finding.within;
+}
 
 int migrateCommand(Arguments args) {
   int status = 0;
@@ -391,7 +469,23 @@ int migrateCommand(Arguments args) {
   if (::stat(sl::systemRoot().c_str(), &rootStatus) != 0 || !S_ISDIR(rootStatus.st_mode))
     return fatal("root " + sl::systemRoot() + " is not a directory");
 
-  // 2. The log file, opened for appending.
+  // 2. The migration markers. The plug-in acts on a marker's paths as they
+  //    stand; one that leads outside the old layout stops the run here,
+  //    before anything is written.
+  if (!options.trustMarkers) {
+    const std::vector<MarkerFinding> findings = untrustedMarkers();
+    if (!findings.empty()) {
+      std::string message = describeMarkerFinding(findings.front());
+      if (findings.size() > 1) {
+        const size_t more = findings.size() - 1;
+        message += "; " + std::to_string(more) + (more == 1 ? " more marker names" : " more markers name") +
+                   " paths outside the old layout";
+      }
+      return fatal(message + "; nothing was changed (--trust-markers uses markers as they stand)");
+    }
+  }
+
+  // 3. The log file, opened for appending.
   sl::UniqueFd logFile;
   if (!options.logFile.empty()) {
     logFile.reset(::open(options.logFile.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
@@ -399,7 +493,7 @@ int migrateCommand(Arguments args) {
     if (!logFile) return fatal("cannot open log file " + options.logFile + ": " + std::strerror(openErrno));
   }
 
-  // 3. The plug-in and its two entry points. It stays loaded until the
+  // 4. The plug-in and its two entry points. It stays loaded until the
   //    process ends.
   const std::string pluginPath = options.plugin.empty() ? defaultPluginPath() : options.plugin;
   void* plugin = ::dlopen(pluginPath.c_str(), RTLD_NOW | RTLD_LOCAL);
@@ -410,7 +504,7 @@ int migrateCommand(Arguments args) {
       reinterpret_cast<DataClassMigratorReleaseFunction>(::dlsym(plugin, kDataClassMigratorReleasePoint));
   if (release == nullptr) return fatal(std::string("not a migration plug-in: ") + ::dlerror());
 
-  // 4. The logs. The installer log's call sites filter by the handle's
+  // 5. The logs. The installer log's call sites filter by the handle's
   //    threshold (debug lines need one); the host log is filtered here.
   static sl::InstallerLogHandle handle;
   handle.threshold = options.logLevel;
@@ -419,13 +513,13 @@ int migrateCommand(Arguments args) {
   LogWriter writer(options, std::move(logFile), terminal);
   ScopedLogSinks sinks(writer);
 
-  // 5. The registry of the root, as the default workspace and library.
+  // 6. The registry of the root, as the default workspace and library.
   sl::Error error;
   std::shared_ptr<EmbeddedRegistry> registry = EmbeddedRegistry::open(SLGlobalConfiguration::sharedInstance(), &error);
   if (!registry) return fatal("cannot open the registry: " + error.description());
   ScopedRegistry defaults(std::move(registry));
 
-  // 6. The migrator; its init loads the start-up state.
+  // 7. The migrator; its init loads the start-up state.
   const auto releaseMigrator = [release](DataClassMigrator* m) { release(m); };
   std::unique_ptr<DataClassMigrator, decltype(releaseMigrator)> migrator(create(), releaseMigrator);
   if (!migrator) return fatal("the plug-in made no migrator (its init failed)");

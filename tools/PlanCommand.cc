@@ -51,8 +51,10 @@ constexpr char kUsage[] =
     "Shows what 'stowline migrate' would do with each entry of the old container\n"
     "root, changing nothing: its classification (record built, marker found,\n"
     "deleted or left in place, and why), the identifier, whether the registry\n"
-    "knows it, the data items and group containers that would move, and the\n"
-    "leftovers that would keep the container in place.\n"
+    "knows it, the data items and group containers that would move, the\n"
+    "leftovers that would keep the container in place, and the migration markers\n"
+    "that name paths outside the old layout (migrate refuses to run over those\n"
+    "without --trust-markers).\n"
     "\n"
     "  --root DIR  the system root (default: $STOWLINE_ROOT, else /)\n"
     "  --json      one JSON object instead of text\n"
@@ -246,6 +248,8 @@ struct Item {
   std::vector<GroupMove> groups;
   std::vector<std::string> leftovers;
   bool listed = true;  // false when the container could not be listed for data items and leftovers
+  // For a marker that names paths outside the old layout.
+  std::optional<MarkerFinding> untrustedMarker;
   // Where the entry is expected to be after migrate: empty when it is gone,
   // otherwise why it stays. (A registry install that fails cannot be
   // foreseen.)
@@ -292,6 +296,10 @@ class Planner {
     if (decision.record.isNull()) return item;
 
     item.record = decision.record;
+    if (decision.kind == mg::DecisionKind::MarkerFound) {
+      const sl::URL marker = url.URLByAppendingPathComponent(mg::kMigrationMarkerName, false);
+      item.untrustedMarker = checkMarkerRecord(item.record, marker, configuration_.oldContainerPath());
+    }
     item.early = decision.early.value_or(false);
     const std::string identifier = stringOf(item.record, mg::kBundleIdentifierKey);
     const std::string bundle = stringOf(item.record, mg::kBundlePathKey);
@@ -546,6 +554,15 @@ int planCommand(Arguments args) {
         w.key("leftovers").beginArray();
         for (const std::string& path : item.leftovers) w.string(path);
         w.endArray();
+        if (item.kind == mg::DecisionKind::MarkerFound) {
+          w.key("untrustedMarker");
+          if (const std::optional<MarkerFinding>& finding = item.untrustedMarker) {
+            w.beginObject().key("marker").string(finding->marker).key("key").string(finding->key);
+            w.key("path").string(finding->path).key("within").string(finding->within).endObject();
+          } else {
+            w.null();
+          }
+        }
       }
       w.endObject();
     }
@@ -592,6 +609,10 @@ int planCommand(Arguments args) {
     std::printf("  reason: %s: %s\n", std::string(sl::logLevelName(item.reasonLevel)).c_str(), item.reason.c_str());
     std::printf("  after migration: %s\n", item.stays.empty() ? "gone" : ("stays (" + item.stays + ")").c_str());
     if (item.record.isNull()) continue;
+    if (item.untrustedMarker) {
+      std::printf("  warning: %s: migrate refuses to run without --trust-markers\n",
+                  describeMarkerFinding(*item.untrustedMarker).c_str());
+    }
     std::printf("  identifier: %s\n", stringOf(item.record, mg::kBundleIdentifierKey).c_str());
     std::printf("  container type: %s%s\n", stringOf(item.record, mg::kContainerTypeKey).c_str(),
                 item.early ? " (migrated early)" : "");

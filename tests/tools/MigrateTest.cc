@@ -1,12 +1,15 @@
 // stowline migrate, digest and config, run as a subprocess on roots built
 // by hand, and the installed program.
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <regex>
 #include <string>
 #include <vector>
 
 #include "Platform/PropertyList.h"
+#include "TestSupport/Sentinel.h"
 #include "TestSupport/TestSupport.h"
 #include "tools/ProgramRunner.h"
 
@@ -19,16 +22,19 @@ using sl::test::TempDir;
 
 const std::string kOldRoot = "/private/var/mobile/Applications";
 
-// An old container root with one application container, and the system
-// version the migration records.
-void makeOldLayout(const std::string& root) {
-  const std::string app = root + kOldRoot + "/C/A.app";
+void makeApp(const std::string& app) {
   sl::test::makeDirs(app);
   ASSERT_TRUE(sl::writePropertyListToURL(sl::Dictionary{{"PBBundleIdentifier", sl::String("com.example.a")},
                                                         {"PBBundleVersion", sl::String("1.0")},
                                                         {"PBBundleExecutable", sl::String("Exec")}},
                                          sl::test::fileURL(app + "/Info.plist")));
   sl::test::writeFile(app + "/Exec", "binary");
+}
+
+// An old container root with one application container, and the system
+// version the migration records.
+void makeOldLayout(const std::string& root) {
+  makeApp(root + kOldRoot + "/C/A.app");
   sl::test::writeFile(root + kOldRoot + "/C/Documents/notes", "user data");
   sl::test::writeFile(root + "/etc/os-release", "NAME=Testix\nVERSION_ID=9.1\nBUILD_ID=21A42\n");
 }
@@ -152,6 +158,100 @@ TEST(MigrateTest, DigestAndConfig) {
   EXPECT_TRUE(hasLine(text.out, std::regex("  dataDirectory +" + data))) << text.out;
   const ProgramResult json = stowline({"config", "--root", dir.path(), "--json"});
   EXPECT_NE(json.out.find("\"dataDirectory\":\"" + data + "\""), std::string::npos) << json.out;
+}
+
+// Writes a migration marker into the old container C below `root` with the
+// paths it names ("" for no second bundle).
+void writeMarker(const std::string& root, const std::string& container, const std::string& bundle,
+                 const std::string& second = "") {
+  sl::Dictionary marker{{"ContainerPath", sl::String(container)},
+                        {"BundlePath", sl::String(bundle)},
+                        {"ContainerType", sl::String("App")},
+                        {"BundleIdentifier", sl::String("com.example.a")}};
+  if (!second.empty()) marker.set("SecondBundlePath", sl::String(second));
+  ASSERT_TRUE(sl::writePropertyListToURL(
+      marker, sl::test::fileURL(root + kOldRoot + "/C/com.vantor.stowline.container_migrator.plist")));
+}
+
+// A marker whose paths lead outside the old layout stops migrate before
+// anything changes; plan shows it; markers naming another container of the
+// root stay allowed.
+TEST(MigrateTest, ForgedMarkersAreRefusedBeforeAnythingChanges) {
+  sl::test::Sentinel sentinel;
+  // "$S" stands for the sentinel, "$O" for the old container root; the root
+  // also holds D/B.app and a link L to the sentinel.
+  const struct {
+    const char *container, *bundle, *second;
+    std::string key;  // of the finding; "" when migrate runs
+  } cases[] = {
+      {"$S", "$S/nested", "", "ContainerPath"},
+      {"$O/L", "$O/L/nested", "", "ContainerPath"},
+      {"$O/C", "$O/C/A.app", "$S/nested", "SecondBundlePath"},
+      {"$O/D", "$O/D/B.app", "", ""},
+  };
+  for (const auto& [container, bundle, second, key] : cases) {
+    SCOPED_TRACE(std::string(container) + " " + key);
+    TempDir root(TempDir::kShm);
+    makeOldLayout(root.path());
+    const std::string old = root.path() + kOldRoot;
+    makeApp(old + "/D/B.app");
+    sl::test::makeSymlink(sentinel.path(), old + "/L");
+    const auto resolve = [&](std::string path) {
+      if (path.starts_with("$")) path.replace(0, 2, path[1] == 'S' ? sentinel.path() : old);
+      return path;
+    };
+    writeMarker(root.path(), resolve(container), resolve(bundle), resolve(second));
+    const auto before = sl::test::listTree(root.path());
+
+    const ProgramResult r = stowline({"migrate", "--root", root.path(), "--no-progress"});
+    EXPECT_THAT(sentinel.changes(), ::testing::IsEmpty());
+    if (key.empty()) {
+      EXPECT_EQ(r.status, 1) << r.err;  // C, whose marker named D, stays, and so does L
+      EXPECT_EQ(r.err.find("stowline migrate: "), std::string::npos) << r.err;
+      EXPECT_FALSE(sl::test::exists(old + "/D"));
+      continue;
+    }
+    const std::string marker = old + "/C/com.vantor.stowline.container_migrator.plist";
+    const std::string path = resolve(key == "ContainerPath" ? container : second);
+    const std::string within = key == "ContainerPath" ? old : old + "/C";
+    const std::string finding = "migration marker " + marker + " names \"" + key + "\" " + path + ", which is not " +
+                                (key == "ContainerPath" ? "a directory directly inside the old container root "
+                                                        : "directly inside its container ") +
+                                within;
+    EXPECT_EQ(r.status, 2);
+    EXPECT_EQ(r.out, "");
+    EXPECT_EQ(r.err, "stowline migrate: " + finding +
+                         "; nothing was changed (--trust-markers uses markers as they stand)\n");
+    EXPECT_EQ(sl::test::listTree(root.path()), before);
+
+    const ProgramResult text = stowline({"plan", "--root", root.path()});
+    EXPECT_NE(text.out.find("\n  warning: " + finding + ": migrate refuses to run without --trust-markers\n"),
+              std::string::npos)
+        << text.out;
+    const ProgramResult json = stowline({"plan", "--root", root.path(), "--json"});
+    EXPECT_NE(json.out.find("\"untrustedMarker\":{\"marker\":\"" + marker + "\",\"key\":\"" + key +
+                            "\",\"path\":\"" + path + "\",\"within\":\"" + within + "\"}"),
+              std::string::npos)
+        << json.out;
+  }
+}
+
+// With --trust-markers the marker is used as it stands: the directory it
+// names outside the root is emptied into the new layout and removed.
+TEST(MigrateTest, TrustedMarkerIsUsedAsItStands) {
+  TempDir root(TempDir::kShm);
+  TempDir scratch(TempDir::kShm);
+  makeOldLayout(root.path());
+  makeApp(scratch / "A.app");
+  sl::test::writeFile(scratch / "Documents/outside.txt", "outside");
+  writeMarker(root.path(), scratch.path(), scratch / "A.app");
+  const ProgramResult r = stowline({"migrate", "--root", root.path(), "--no-progress", "--trust-markers"});
+  EXPECT_EQ(r.status, 1) << r.err;  // C itself stays: its marker named another directory
+  EXPECT_FALSE(sl::test::exists(scratch.path()));
+  const auto tree = sl::test::listTree(root.path());
+  EXPECT_TRUE(std::any_of(tree.begin(), tree.end(), [](const auto& item) {
+    return item.first.ends_with("/Documents/outside.txt") && item.second.ends_with(" outside");
+  }));
 }
 
 // The installed program runs from its own directories and loads the plug-in
