@@ -91,13 +91,20 @@ String bundleIdentifierForBundle(const URL& bundle) {
 }
 
 MarkerValidation validateMigrationMarker(const URL& url) {
+  std::vector<uint8_t> bytes;
+  // A file that cannot be read holds no dictionary, just as an empty one.
+  if (!readFileContents(url, &bytes)) bytes.clear();
+  return validateMigrationMarkerData(bytes, url);
+}
+
+MarkerValidation validateMigrationMarkerData(std::span<const uint8_t> bytes, const URL& url) {
   MarkerValidation result;
   auto reject = [&result](std::string text) {
     result.messages.push_back({kLogLevelError, kValidateMarkerFunctionName, std::move(text)});
     return std::move(result);
   };
   // Missing, unreadable, malformed or not a dictionary all read as null.
-  Dictionary marker = dictionaryWithContentsOfURL(url);
+  Dictionary marker = propertyListFromData(bytes).asDictionary();
   if (marker.isNull()) return reject(sl::format("SLAppMigrator: Failed to load migration marker file from %@", url));
   if (!isStringValue(marker.get(kBundlePathKey))) {
     return reject(sl::format("SLAppMigrator: Failed to get bundle path from migration marker file %@", url));

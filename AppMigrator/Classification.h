@@ -9,7 +9,9 @@
 // deleting the entry) is the caller's business.
 #pragma once
 
+#include <cstdint>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -44,6 +46,10 @@ struct MarkerValidation {
 
 // Reads the marker at `url` and checks its keys; never logs.
 MarkerValidation validateMigrationMarker(const URL& url);
+
+// Checks the marker whose file content is `bytes`, as the call above does
+// with what it reads; `url` is the file the messages name.
+MarkerValidation validateMigrationMarkerData(std::span<const uint8_t> bytes, const URL& url);
 
 // The identifier that the bundle directory declares; null when it cannot be
 // read as a bundle or declares none.

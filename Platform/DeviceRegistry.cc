@@ -368,6 +368,20 @@ size_t dvOutstandingHandles() {
   return s.outstanding;
 }
 
+std::vector<MountEntry> parseMountInfo(std::string_view text) {
+  std::vector<MountEntry> table;
+  size_t i = 0;
+  while (i < text.size()) {
+    size_t end = text.find('\n', i);
+    if (end == std::string_view::npos) end = text.size();
+    if (std::optional<MountEntry> entry = parseMountInfoLine(text.substr(i, end - i))) {
+      table.push_back(std::move(*entry));
+    }
+    i = end + 1;
+  }
+  return table;
+}
+
 std::vector<MountEntry> getmntinfo() {
   std::string path;
   {
@@ -377,16 +391,7 @@ std::vector<MountEntry> getmntinfo() {
   }
   std::string text;
   if (!readWholeFile(path, text)) return {};  // errno from the open or read
-  std::vector<MountEntry> table;
-  size_t i = 0;
-  while (i < text.size()) {
-    size_t end = text.find('\n', i);
-    if (end == std::string::npos) end = text.size();
-    if (std::optional<MountEntry> entry = parseMountInfoLine(std::string_view(text).substr(i, end - i))) {
-      table.push_back(std::move(*entry));
-    }
-    i = end + 1;
-  }
+  std::vector<MountEntry> table = parseMountInfo(text);
   // Every process has its root mounted: a file without a single mount in it
   // is not a mount table.
   if (table.empty()) errno = EINVAL;

@@ -93,4 +93,8 @@ struct MountEntry {
 // all).
 std::vector<MountEntry> getmntinfo();
 
+// The mounts that mountinfo text lists, as getmntinfo reads them (without
+// its errno: an empty result is just empty).
+std::vector<MountEntry> parseMountInfo(std::string_view text);
+
 }  // namespace sl

@@ -33,7 +33,9 @@
 // shared container lands. What the reader returns is such a tree all the
 // same (its handles share the nodes), and describing, comparing or writing
 // it visits every place a node lands, so a file whose top object unfolds to
-// more than kMaxUnfoldedValues values is refused.
+// more values than unfoldLimit() allows is refused. Without shared containers
+// a file unfolds to at most about one value per byte; the limit leaves room
+// for sharing sixteen times that, and never more than kMaxUnfoldedValues.
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
@@ -50,6 +52,12 @@ constexpr uint8_t kMagic[8] = {'b', 'p', 'l', 'i', 's', 't', '0', '0'};
 constexpr size_t kHeaderSize = sizeof kMagic;
 constexpr size_t kTrailerSize = 32;
 constexpr uint64_t kMaxUnfoldedValues = uint64_t{1} << 24;
+constexpr uint64_t kUnfoldedValuesPerByte = 16;
+constexpr uint64_t kUnfoldedValuesAlways = 4096;
+
+uint64_t unfoldLimit(size_t fileSize) {
+  return std::min<uint64_t>(kMaxUnfoldedValues, kUnfoldedValuesAlways + kUnfoldedValuesPerByte * fileSize);
+}
 
 using ull = unsigned long long;
 
@@ -256,8 +264,9 @@ class BinaryReader {
           if (!parseObject(ref, level + 1, v)) return false;
           childHeight = std::max(childHeight, int{height_[ref]});
           unfolded += unfolded_[ref];
-          if (unfolded > kMaxUnfoldedValues)
-            return bad(format("object %llu unfolds to more than %llu values", ull{index}, ull{kMaxUnfoldedValues}));
+          if (unfolded > unfoldLimit(bytes_.size()))
+            return bad(format("object %llu unfolds to more than %llu values", ull{index},
+                              ull{unfoldLimit(bytes_.size())}));
           return true;
         };
         if (isDict) {
@@ -327,7 +336,7 @@ class BinaryReader {
   uint64_t tableOffset_ = 0;
   std::vector<uint8_t> state_;
   std::vector<uint16_t> height_;  // containers from the object down, at most kMaxPropertyListDepth
-  std::vector<uint64_t> unfolded_;  // values in the tree the object unfolds to, at most kMaxUnfoldedValues
+  std::vector<uint64_t> unfolded_;  // values in the tree the object unfolds to, at most unfoldLimit()
   std::vector<Value> cache_;
   std::string message_;
 };

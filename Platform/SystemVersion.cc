@@ -52,7 +52,7 @@ std::optional<std::string> parseValue(std::string_view text) {
   return std::string(text);
 }
 
-std::map<std::string, std::string, std::less<>> parseOsRelease(std::string_view text) {
+std::map<std::string, std::string, std::less<>> parseAssignments(std::string_view text) {
   std::map<std::string, std::string, std::less<>> assignments;
   while (!text.empty()) {
     const size_t newline = text.find('\n');
@@ -79,8 +79,11 @@ Dictionary copySystemVersionDictionary() {
   std::vector<uint8_t> bytes;
   const URL source = URL::fileURLWithPath(pathBelowSystemRoot("/etc/os-release"), false);
   if (!readFileContents(source, &bytes)) return nullptr;
-  const auto assignments =
-      parseOsRelease(std::string_view(reinterpret_cast<const char*>(bytes.data()), bytes.size()));
+  return parseOSRelease(std::string_view(reinterpret_cast<const char*>(bytes.data()), bytes.size()));
+}
+
+Dictionary parseOSRelease(std::string_view text) {
+  const auto assignments = parseAssignments(text);
 
   auto lookup = [&assignments](std::string_view key) -> String {
     const auto it = assignments.find(key);

@@ -18,6 +18,8 @@
 // an earlier one. An empty value counts as absent.
 #pragma once
 
+#include <string_view>
+
 #include "Platform/Value.h"
 
 namespace sl {
@@ -30,5 +32,8 @@ inline constexpr char kSystemBuildVersionKey[] = "SystemBuildVersion";
 // out (so the dictionary may be empty). Null when the file is missing or
 // cannot be read.
 Dictionary copySystemVersionDictionary();
+
+// The dictionary that os-release text describes, as above; never null.
+Dictionary parseOSRelease(std::string_view text);
 
 }  // namespace sl

@@ -301,11 +301,14 @@ TEST(PropertyListTest, RefusesBadBinary) {
 
   std::vector<uint8_t> hugeArray{0xAF, 0x13, 0x7F, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0};
   std::vector<uint8_t> hugeUTF16{0x6F, 0x13, 0x80, 0, 0, 0, 0, 0, 0, 0};  // count * 2 overflows
+  std::vector<uint8_t> hugeDictionary{0xDF, 0x13, 0x80, 0, 0, 0, 0, 0, 0, 0};
   const std::tuple<const char*, std::vector<std::vector<uint8_t>>, const char*> cases[] = {  // what, objects, message
       {"reference out of range", {{0xA2, 1, 9}, {0x09}}, "bplist: object reference 9 out of range (2 objects)"},
       {"cycle", {{0xA1, 1}, {0xD1, 2, 0}, {0x51, 'k'}}, "bplist: object 0 contains itself"},
+      {"array holding itself", {{0xA1, 0}}, "bplist: object 0 contains itself"},
       {"huge array", {hugeArray}, "count 9223372036854775807 runs past the end"},
       {"huge UTF-16 string", {hugeUTF16}, "runs past the end"},
+      {"huge dictionary", {hugeDictionary}, "count 9223372036854775808 runs past the end"},  // count * 2 overflows
       {"count past the objects", {{0x58, 'a', 'b'}}, "bplist: object 0: count 8 runs past the end"},
       {"malformed count", {{0x4F, 0x23, 0, 0, 0, 0, 0, 0, 0, 0}}, "count of object 0 is not an integer"},
       {"non-string key", {{0xD1, 1, 1}, {0x10, 7}}, "key 0 of dictionary object 0 is a Number, not a string"},
@@ -318,6 +321,30 @@ TEST(PropertyListTest, RefusesBadBinary) {
   for (const auto& [what, objects, message] : cases) {
     SCOPED_TRACE(what);
     expectRefused(BinaryFile(objects).finish(0, 1, 1), message);
+  }
+}
+
+TEST(PropertyListTest, BinaryFieldsOfSixtyFourBitsCannotOverflow) {
+  // Eight-byte offsets and references, so that each field can hold 2^64 - 1.
+  const std::vector<uint8_t> good = BinaryFile({{0xA1, 0, 0, 0, 0, 0, 0, 0, 1}, {0x51, 'x'}}).finish(0, 8, 8);
+  ASSERT_TRUE(propertyListFromData(good) == Array{String("x")});
+  constexpr uint64_t kMax = ~uint64_t{0};
+  const std::tuple<const char*, ptrdiff_t, uint64_t, const char*> cases[] = {  // what, position (< 0: from the end)
+      {"count times offset size wraps to 8", -24, (uint64_t{1} << 61) + 1,
+       "offset table of 2305843009213693953 objects runs past the trailer"},
+      {"largest count", -24, kMax, "offset table of 18446744073709551615 objects runs past the trailer"},
+      {"one object more than the table holds", -24, 3, "offset table of 3 objects runs past the trailer"},
+      {"largest top object", -16, kMax, "top object 18446744073709551615 out of range (2 objects)"},
+      {"largest table offset", -8, kMax, "offset table at 18446744073709551615 is outside the file"},
+      {"largest object offset", -40, kMax, "offset 18446744073709551615 of object 1 is outside the objects"},
+      {"largest reference", 9, kMax, "object reference 18446744073709551615 out of range (2 objects)"},
+  };
+  for (const auto& [what, position, value, message] : cases) {
+    SCOPED_TRACE(what);
+    std::vector<uint8_t> bad = good, field;
+    appendBE(&field, value, 8);
+    std::copy(field.begin(), field.end(), (position < 0 ? bad.end() : bad.begin()) + position);
+    expectRefused(bad, message);
   }
 }
 
@@ -347,15 +374,17 @@ TEST(PropertyListTest, BinaryNestingAndSharingAreBounded) {
     f.add({0x54, 'l', 'e', 'a', 'f'});
     return f.finish(0, 2, 1);
   };
-  Value value = propertyListFromData(doubling(20));  // 2^21 values: read, sharing its nodes
-  for (int k = 0; k < 20; ++k) {
+  Value value = propertyListFromData(doubling(11));  // 4,095 values: read, sharing its nodes
+  for (int k = 0; k < 11; ++k) {
     ASSERT_EQ(value.asArray().count(), 2u) << value.description();
     value = value.asArray().at(1);
   }
   EXPECT_EQ(value.asString().str(), "leaf");
-  // 2^101 values: anything that walks the result (a description, a write)
-  // would never finish, so the reader refuses it.
-  expectRefused(doubling(100), "bplist: object 76 unfolds to more than 16777216 values");
+  // Past 4,096 + 16 values per byte: anything that walks the result (a
+  // description, a write) would take time and memory out of all proportion
+  // to the file, so the reader refuses it, 2^23 values as much as 2^101.
+  expectRefused(doubling(22), "bplist: object 10 unfolds to more than 6608 values");
+  expectRefused(doubling(100), "bplist: object 87 unfolds to more than 12848 values");
 }
 
 TEST(PropertyListTest, FilesThatHoldNoDictionary) {
