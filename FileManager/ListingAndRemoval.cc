@@ -11,7 +11,6 @@
 #include <string_view>
 
 #include "FileManager/SLFileManager.h"
-#include "FileManager/StowlineAdditions.h"
 #include "Platform/Removefile.h"
 #include "Platform/UniqueFd.h"
 #include "Support/Errors.h"
@@ -144,8 +143,7 @@ std::optional<std::vector<sl::URL>> SLFileManager::urlsForItemsInDirectoryAtURL(
       SLLog(sl::kLogLevelNotice, kFunctionName, "Ignoring symlink at %s/%s", directoryPath, name);
       return true;
     }
-    sl::String component = StowlineAdditions::stringWithFileSystemRepresentation(entry.name, entry.nameLength);
-    urls.push_back(url.URLByAppendingPathComponent(component.view(), entry.type == DT_DIR));
+    urls.push_back(url.URLByAppendingPathComponent(name, entry.type == DT_DIR));
     return true;
   });
 

@@ -75,8 +75,10 @@
 // (between most pairs of different file systems, so on every move across
 // volumes) the copy goes on from the same offset with sendfile, which also
 // stays in the kernel and is markedly faster than a copy through user
-// memory; where that cannot be used either, with pread and pwrite through
-// one 128 KiB buffer. copyFileRangeRefused and sendfileRefused list the
+// memory (measured: a 1 GiB file from disk to /dev/shm); where that cannot
+// be used either, with pread and pwrite through one 256 KiB buffer. A
+// refusal of copy_file_range is remembered for the pair of volumes, so a
+// tree copied across volumes pays for it once, not once per file. copyFileRangeRefused and sendfileRefused list the
 // errnos that step down; any other errno fails the copy. A file with fewer
 // blocks than its size has holes: only its data segments (SEEK_DATA,
 // SEEK_HOLE) are copied and the holes stay holes. No file is ever read into
@@ -148,6 +150,7 @@
 #include <vector>
 
 #include "Platform/DirectoryEntries.h"
+#include "Platform/Mutations.h"
 #include "Platform/UniqueFd.h"
 
 struct sl::copyfile_state {};
@@ -167,7 +170,7 @@ constexpr size_t kMaxOpenLevels = 32;
 constexpr int kSizeProbeAttempts = 4;
 constexpr int kTemporaryNameAttempts = 16;
 constexpr size_t kKernelChunk = size_t{1} << 30;
-constexpr size_t kBufferSize = size_t{128} << 10;  // fits the caches: faster than larger
+constexpr size_t kBufferSize = size_t{256} << 10;
 constexpr mode_t kWorkingFileMode = S_IRUSR | S_IWUSR;
 constexpr mode_t kWorkingDirectoryMode = S_IRWXU;
 constexpr char kAclAccess[] = "system.posix_acl_access";
@@ -242,12 +245,12 @@ struct AttributePlace {
     return follow ? ::getxattr(path.c_str(), name, buffer, size) : ::lgetxattr(path.c_str(), name, buffer, size);
   }
   int set(const char* name, const void* value, size_t size) const {
-    if (fd >= 0) return ::fsetxattr(fd, name, value, size, 0);
-    return ::lsetxattr(path.c_str(), name, value, size, 0);
+    if (fd >= 0) return mut::fsetxattr(fd, name, value, size, 0);
+    return mut::lsetxattr(path.c_str(), name, value, size, 0);
   }
   int remove(const char* name) const {
-    if (fd >= 0) return ::fremovexattr(fd, name);
-    return ::lremovexattr(path.c_str(), name);
+    if (fd >= 0) return mut::fremovexattr(fd, name);
+    return mut::lremovexattr(path.c_str(), name);
   }
 };
 
@@ -325,15 +328,15 @@ struct Target {
   bool isLink = false;
 
   int chown(uid_t uid, gid_t gid) const {
-    return fd >= 0 ? ::fchown(fd, uid, gid) : ::fchownat(dirFd, name->c_str(), uid, gid, AT_SYMLINK_NOFOLLOW);
+    return fd >= 0 ? mut::fchown(fd, uid, gid) : mut::fchownat(dirFd, name->c_str(), uid, gid, AT_SYMLINK_NOFOLLOW);
   }
   // A link has no mode of its own on Linux.
   int chmod(mode_t mode) const {
     if (isLink) return 0;
-    return fd >= 0 ? ::fchmod(fd, mode) : ::fchmodat(dirFd, name->c_str(), mode, AT_SYMLINK_NOFOLLOW);
+    return fd >= 0 ? mut::fchmod(fd, mode) : mut::fchmodat(dirFd, name->c_str(), mode, AT_SYMLINK_NOFOLLOW);
   }
   int setTimes(const timespec times[2]) const {
-    return fd >= 0 ? ::futimens(fd, times) : ::utimensat(dirFd, name->c_str(), times, AT_SYMLINK_NOFOLLOW);
+    return fd >= 0 ? mut::futimens(fd, times) : mut::utimensat(dirFd, name->c_str(), times, AT_SYMLINK_NOFOLLOW);
   }
   AttributePlace attributes() const {
     return fd >= 0 ? AttributePlace::of(fd) : AttributePlace::at(dirFd, *name, false);
@@ -364,14 +367,14 @@ class PendingReplacement {
   ~PendingReplacement() {
     if (name_.empty()) return;
     int saved = errno;
-    unlinkat(dirFd_, name_.c_str(), 0);
+    mut::unlinkat(dirFd_, name_.c_str(), 0);
     errno = saved;
   }
 
   // Puts the item in place (nothing to do when it was made there).
   int commit(const std::string& finalName) {
     if (name_.empty()) return 0;
-    if (renameat(dirFd_, name_.c_str(), dirFd_, finalName.c_str()) != 0) return errno;
+    if (mut::renameat(dirFd_, name_.c_str(), dirFd_, finalName.c_str()) != 0) return errno;
     name_.clear();
     return 0;
   }
@@ -489,6 +492,9 @@ class Copier {
       return errno;
     }
 
+    struct stat parentSt;
+    if (fstat(dstParent.get(), &parentSt) != 0) return errno;
+    dstDev_ = parentSt.st_dev;
     const bool inherits =
         (flags_ & COPYFILE_ACL) != 0 && hasDefaultAcl(AttributePlace::at(dstParent.get(), ".", false));
     unsigned char type = S_ISDIR(st.st_mode) ? DT_DIR : S_ISREG(st.st_mode) ? DT_REG : DT_UNKNOWN;
@@ -505,6 +511,7 @@ class Copier {
       if (level.next < level.entries.size()) {
         // copyEntry may push a level: work on a copy of what it needs.
         Entry entry = std::move(level.entries[level.next++]);
+        dstDev_ = level.dstId.dev;
         const int err =
             copyEntry(level.src.get(), entry.name, entry.type, false, level.dst.get(), entry.name, level.inherits);
         if (err != 0) return err;
@@ -553,7 +560,7 @@ class Copier {
     UniqueFd out;
     std::string temporary;
     int err = makeNonDirectory(dstDir, dstName, temporary, [&](const char* name) {
-      out = UniqueFd(openat(dstDir, name, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, createMode));
+      out = UniqueFd(mut::openat(dstDir, name, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, createMode));
       return out ? 0 : errno;
     });
     if (err != 0) return err;
@@ -580,11 +587,11 @@ class Copier {
     int err = makeNonDirectory(dstDir, dstName, temporary, [&](const char* made) {
       int result;
       if (link) {
-        result = symlinkat(linkTarget.c_str(), dstDir, made);
+        result = mut::symlinkat(linkTarget.c_str(), dstDir, made);
       } else if (S_ISFIFO(st.st_mode)) {
-        result = mkfifoat(dstDir, made, createMode);
+        result = mut::mkfifoat(dstDir, made, createMode);
       } else {
-        result = mknodat(dstDir, made, (st.st_mode & S_IFMT) | createMode, st.st_rdev);
+        result = mut::mknodat(dstDir, made, (st.st_mode & S_IFMT) | createMode, st.st_rdev);
       }
       return result == 0 ? 0 : errno;
     });
@@ -607,7 +614,7 @@ class Copier {
         (flags_ & COPYFILE_STAT) != 0 ? kWorkingDirectoryMode : ((st.st_mode & 0777) | S_IRWXU);
     const int openFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
     bool made = false;
-    if (mkdirat(dstDir, dstName.c_str(), createMode) == 0) {
+    if (mut::mkdirat(dstDir, dstName.c_str(), createMode) == 0) {
       made = true;
       level.dst = UniqueFd(openat(dstDir, dstName.c_str(), openFlags));
       if (!level.dst) return errno;
@@ -730,7 +737,7 @@ class Copier {
 
   int copyData(int in, int out, const struct stat& st) {
     if (st.st_size == 0) return 0;
-    if (st.st_blocks * 512 >= st.st_size) return copyRange(in, out, 0, st.st_size);
+    if (st.st_blocks * 512 >= st.st_size) return copyRange(in, out, 0, st.st_size, st.st_dev);
     // Holes: copy the data segments, then set the size (the file may end in
     // a hole).
     off_t position = 0;
@@ -740,17 +747,17 @@ class Copier {
         int err = errno;
         if (err == ENXIO) break;  // only a hole from here on
         // A file system that cannot tell: copy everything.
-        if (position == 0 && (err == EINVAL || err == EOPNOTSUPP)) return copyRange(in, out, 0, st.st_size);
+        if (position == 0 && (err == EINVAL || err == EOPNOTSUPP)) return copyRange(in, out, 0, st.st_size, st.st_dev);
         return err;
       }
       if (data >= st.st_size) break;
       off_t hole = lseek(in, data, SEEK_HOLE);
       if (hole < 0) return errno;
       hole = std::min(hole, st.st_size);
-      if (int err = copyRange(in, out, data, hole); err != 0) return err;
+      if (int err = copyRange(in, out, data, hole, st.st_dev); err != 0) return err;
       position = hole;
     }
-    if (ftruncate(out, st.st_size) != 0) return errno;
+    if (mut::ftruncate(out, st.st_size) != 0) return errno;
     return 0;
   }
 
@@ -758,28 +765,43 @@ class Copier {
   // copy_file_range, else by sendfile, else through the buffer. A call that
   // refuses (see the errno lists) or copies nothing hands the rest of the
   // range to the next way; pread finding the end means that the file
-  // shrank, and the copy stops there.
-  int copyRange(int in, int out, off_t begin, off_t end) {
+  // shrank, and the copy stops there. A refusal of copy_file_range is
+  // remembered for the pair of volumes, so the files after the first one
+  // between them go straight to the next way.
+  int copyRange(int in, int out, off_t begin, off_t end, dev_t srcDev) {
     enum class Way { kCopyFileRange, kSendfile, kBuffer };
-    Way way = copyfile_test_buffered_data ? Way::kBuffer : Way::kCopyFileRange;
+    const std::pair<dev_t, dev_t> volumes(srcDev, dstDev_);
+    Way way = copyfile_test_buffered_data                     ? Way::kBuffer
+              : kernelCopyRefused_ && refusedVolumes_ == volumes ? Way::kSendfile
+                                                              : Way::kCopyFileRange;
     off64_t inOffset = begin;
     off64_t outOffset = begin;
+    // sendfile writes at the file position of out, which is 0 until a
+    // sendfile or write moves it (out is a new file).
+    bool positioned = begin == 0;
     while (inOffset < end) {
       const size_t wanted = static_cast<size_t>(std::min<off64_t>(end - inOffset, kKernelChunk));
       if (way == Way::kCopyFileRange) {
-        ssize_t copied = copy_file_range(in, &inOffset, out, &outOffset, wanted, 0);
+        ssize_t copied = mut::copy_file_range(in, &inOffset, out, &outOffset, wanted, 0);
         if (copied > 0) continue;
         int err = errno;
         if (copied < 0 && err == EINTR) continue;
         if (copied < 0 && !copyFileRangeRefused(err)) return err;
+        if (copied < 0) {
+          kernelCopyRefused_ = true;
+          refusedVolumes_ = volumes;
+        }
         way = Way::kSendfile;
-        // sendfile writes at the file position of out.
-        if (lseek(out, outOffset, SEEK_SET) < 0) return errno;
+        positioned = positioned && outOffset == 0;
         continue;
       }
       if (way == Way::kSendfile) {
+        if (!positioned) {
+          if (lseek(out, outOffset, SEEK_SET) < 0) return errno;
+          positioned = true;
+        }
         off_t offset = inOffset;
-        ssize_t sent = sendfile(out, in, &offset, wanted);
+        ssize_t sent = mut::sendfile(out, in, &offset, wanted);
         if (sent > 0) {
           inOffset += sent;
           outOffset += sent;
@@ -799,7 +821,7 @@ class Copier {
       }
       if (got == 0) break;
       for (ssize_t written = 0; written < got;) {
-        ssize_t put = pwrite(out, buffer_.get() + written, static_cast<size_t>(got - written), outOffset);
+        ssize_t put = mut::pwrite(out, buffer_.get() + written, static_cast<size_t>(got - written), outOffset);
         if (put < 0) {
           if (errno == EINTR) continue;
           return errno;
@@ -819,6 +841,9 @@ class Copier {
   size_t lowestOpen_ = 0;
   std::set<Identity> made_;  // directories this copy made
   std::unique_ptr<char[]> buffer_;
+  dev_t dstDev_ = 0;  // volume of the destination directory at hand
+  bool kernelCopyRefused_ = false;  // copy_file_range refused between
+  std::pair<dev_t, dev_t> refusedVolumes_;  // these volumes (source, destination)
   std::string names_;  // scratch for attribute lists
 };
 

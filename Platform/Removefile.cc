@@ -45,24 +45,60 @@
 // when nothing stands there), and a parent that cannot be opened again or is
 // not the directory it was (ESTALE, see below).
 //
-// Mount points get no special treatment: a file system mounted inside the
-// tree is emptied like any directory, and its root then fails rmdir (EBUSY),
-// which is reported.
+// Mount points: the walk never enters a file system mounted inside the tree
+// (a bind mount included: mount identities are compared, not devices). The
+// mount point is reported with EBUSY, what its rmdir would answer, and the
+// mounted tree is left as it was. The item removefile was asked for is
+// entered even when it is itself a mount point: that is the caller's choice.
+//
+// Parallel walk. A tree large enough to pay for it (kParallelAfterEntries
+// entries listed) is walked by kWorkers threads: the caller's and threads
+// started for this call only, so they carry the caller's credentials
+// (including a per-thread file-system uid). A walk that meets a directory at
+// most kSplitDepth levels down, while the shared queue is short, hands the
+// directory to the queue as a job instead of entering it; the job is a walk
+// of its own, rooted at the descriptor of the directory that holds it. That
+// directory becomes an Anchor: it keeps its descriptor open and counts the
+// holds on it (its own walk's, one per job handed off from it, one per child
+// anchor still waiting). Its rmdir is done by whichever thread releases the
+// last hold, so a directory still goes only after everything in it, and no
+// thread ever waits for another to remove a subtree. Anchors exist only for
+// the shallow directories and jobs are few, so the descriptors held stay
+// bounded: each walk keeps at most kMaxOpenLevels, anchors at most
+// kSplitDepth per job in flight. A process whose descriptor limit is below
+// kParallelMinDescriptors is walked by the caller alone.
+//
+// The error callback is called by any of the threads, one call at a time
+// (under a lock), so a callback written for the single-threaded walk works
+// unchanged, context included. The order of the reports across subtrees is
+// the order in which the threads meet the failures. A REMOVEFILE_STOP (or
+// any failure that ends the walk) stops every thread: no callback is called
+// after it, queued jobs are dropped, and removefile returns -1 with the errno
+// of the first failure that stopped it.
 
 #include "Platform/Removefile.h"
 
 #include <dirent.h>
 #include <fcntl.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cerrno>
+#include <condition_variable>
+#include <deque>
+#include <memory>
+#include <mutex>
 #include <new>
 #include <string>
+#include <system_error>
+#include <thread>
 #include <utility>
 #include <vector>
 
 #include "Platform/DirectoryEntries.h"
+#include "Platform/Mutations.h"
 #include "Platform/UniqueFd.h"
 
 struct sl::removefile_state {
@@ -84,6 +120,11 @@ void (*removefile_test_hook_after_listing)(int dirFd, const char* path) = nullpt
 namespace {
 
 constexpr size_t kMaxOpenLevels = 32;
+constexpr unsigned kWorkers = 4;  // the caller's thread included
+constexpr size_t kParallelAfterEntries = 512;
+constexpr size_t kSplitDepth = 6;  // directories deeper than this are not handed off
+constexpr size_t kQueueTarget = 2 * kWorkers;
+constexpr rlim_t kParallelMinDescriptors = 1024;
 
 // What an entry of a listing is taken to be before it is touched.
 enum class Kind { kDirectory, kOther };
@@ -93,50 +134,217 @@ using Entry = DirectoryEntry;
 // What the listing says an entry is; only asked when its type is known.
 Kind kindOf(const Entry& entry) { return entry.type == DT_DIR ? Kind::kDirectory : Kind::kOther; }
 
-// One directory on the way down from the top item.
-struct Level {
-  UniqueFd fd;  // closed while the level is evicted
-  dev_t dev;    // identity recorded when the directory was entered
-  ino_t ino;
-  std::string name;  // name in the parent directory
-  std::vector<Entry> entries;
-  size_t next = 0;  // first entry not yet handled
-};
-
 // A step of the walk either lets it go on or ends it with -1 and errno.
 enum class Step { kGoOn, kStop };
 
 // What one attempt at an entry came to.
 enum class Attempt { kDone, kWrongKind, kFailed };
 
+// A directory whose rmdir waits for work handed to other threads.
+struct Anchor {
+  UniqueFd fd;               // the directory: base of the *at calls of its jobs
+  std::atomic<int> holds{1};  // its own walk's, then one per job and per waiting child
+  // Filled by the owning walk before it releases its hold:
+  int parentFd = -1;  // the directory that holds it: the parent anchor's or the top parent's
+  std::shared_ptr<Anchor> parent;  // holds a hold on it; null for the top item
+  std::string name;
+  std::string path;  // reported if its rmdir fails
+};
+using AnchorPtr = std::shared_ptr<Anchor>;
+
+// A directory handed off: removed, contents first, by a walk of its own.
+struct Job {
+  AnchorPtr anchor;  // the directory that holds it, with one hold for the job
+  std::string name;
+  std::string path;
+  size_t depth;  // levels below the top item
+};
+
+class Walk;
+
+// What the walks of one removefile call share: the state and its callback,
+// the queue of jobs and the threads, and the end of the walk.
+class Shared {
+ public:
+  Shared(removefile_state* state, bool recursive) : state_(state), recursive_(recursive) {}
+  Shared(const Shared&) = delete;
+  Shared& operator=(const Shared&) = delete;
+  ~Shared() { drain(); }
+
+  bool recursive() const { return recursive_; }
+  bool stopped() const { return stopped_.load(std::memory_order_acquire); }
+
+  // Reports an entry to the callback, one call at a time. Returns kStop (and
+  // stops every walk) when the callback asks for it, when there is none, or
+  // when the walk is already stopped.
+  Step report(const std::string& path, int err) {
+    std::lock_guard<std::mutex> hold(reportLock_);
+    if (stopped()) return Step::kStop;
+    removefile_callback_t callback = state_ != nullptr ? state_->callback : nullptr;
+    if (callback != nullptr) {
+      state_->entryErrno = err;
+      int answer = callback(state_, path.c_str(), state_->context);
+      if (answer == REMOVEFILE_PROCEED || answer == REMOVEFILE_SKIP) return Step::kGoOn;
+    }
+    stop(err);
+    return Step::kStop;
+  }
+
+  // Ends the walk with err; the first stop's errno is the one returned.
+  void stop(int err) {
+    std::lock_guard<std::mutex> hold(lock_);
+    if (stopped()) return;
+    stopErrno_ = err;
+    stopped_.store(true, std::memory_order_release);
+    wake_.notify_all();
+  }
+
+  // Counts entries listed; a walk large enough starts the other threads.
+  void noteListed(size_t count) {
+    if (!recursive_ || tried_) return;
+    listed_ += count;
+    if (listed_ >= kParallelAfterEntries) startThreads();
+  }
+
+  // Whether a directory `depth` levels below the top item goes to the queue.
+  bool shouldHandOff(size_t depth) const {
+    return started_ && depth <= kSplitDepth && queued_.load(std::memory_order_relaxed) < kQueueTarget;
+  }
+
+  void push(Job job) {
+    std::lock_guard<std::mutex> hold(lock_);
+    queue_.push_back(std::move(job));
+    queued_.store(queue_.size(), std::memory_order_relaxed);
+    ++inFlight_;
+    wake_.notify_one();
+  }
+
+  // Releases one hold on `anchor`; the last one removes its directory, then
+  // releases the hold it had on its parent, and so on up.
+  Step release(AnchorPtr anchor) {
+    while (anchor) {
+      if (anchor->holds.fetch_sub(1, std::memory_order_acq_rel) != 1) return Step::kGoOn;
+      anchor->fd.reset();  // closes the directory before its rmdir
+      if (stopped()) return Step::kStop;
+      if (mut::unlinkat(anchor->parentFd, anchor->name.c_str(), AT_REMOVEDIR) != 0) {
+        int err = errno;
+        if (report(anchor->path, err) == Step::kStop) return Step::kStop;
+      }
+      anchor = std::move(anchor->parent);
+    }
+    return Step::kGoOn;
+  }
+
+  // Runs the queued jobs on the caller's thread too, until none is left,
+  // then lets the threads go. Returns 0, or -1 with the errno of the stop.
+  int finish() {
+    drain();
+    if (!stopped()) return 0;
+    errno = stopErrno_;
+    return -1;
+  }
+
+ private:
+  void startThreads();
+  void runJob(Job job);
+
+  // Takes a job; waits while others run and may hand off more. False when
+  // none is left and none runs (or, for a thread, once drain says so).
+  bool take(Job& job, bool caller) {
+    std::unique_lock<std::mutex> hold(lock_);
+    for (;;) {
+      if (!queue_.empty()) {
+        job = std::move(queue_.front());
+        queue_.pop_front();
+        queued_.store(queue_.size(), std::memory_order_relaxed);
+        return true;
+      }
+      if (caller ? inFlight_ == 0 : done_) return false;
+      wake_.wait(hold);
+    }
+  }
+
+  void drain() {
+    Job job;
+    while (!threads_.empty() && take(job, true)) runJob(std::move(job));
+    {
+      std::lock_guard<std::mutex> hold(lock_);
+      done_ = true;
+      wake_.notify_all();
+    }
+    for (std::thread& thread : threads_) thread.join();
+    threads_.clear();
+  }
+
+  removefile_state* state_;
+  const bool recursive_;
+  std::mutex reportLock_;  // one callback at a time; taken before lock_
+  std::mutex lock_;        // the queue and the counts below
+  std::condition_variable wake_;
+  std::deque<Job> queue_;
+  std::atomic<size_t> queued_{0};  // queue_.size(), read without the lock
+  size_t inFlight_ = 0;             // jobs queued or running
+  bool done_ = false;
+  std::atomic<bool> stopped_{false};
+  int stopErrno_ = 0;
+  // Only the caller's thread touches these.
+  size_t listed_ = 0;
+  bool tried_ = false;
+  bool started_ = false;
+  std::vector<std::thread> threads_;
+};
+
+// One directory on the way down from the top item of a walk.
+struct Level {
+  UniqueFd fd;  // closed while the level is evicted; moved into the anchor
+  dev_t dev;    // identity recorded when the directory was entered
+  ino_t ino;
+  std::string name;  // name in the parent directory
+  std::vector<Entry> entries;
+  size_t next = 0;   // first entry not yet handled
+  AnchorPtr anchor;  // set once work was handed off from it
+
+  int dirFd() const { return anchor ? anchor->fd.get() : fd.get(); }
+};
+
 class Walk {
  public:
-  Walk(removefile_state* state, std::string topPath, UniqueFd topParent, std::string topName, bool recursive)
-      : state_(state),
+  // A walk of the item `topName` in topParent, reported as topPath, `depth`
+  // levels below the item removefile was asked for; topAnchor is the anchor
+  // that holds it when it is a job.
+  Walk(Shared& shared, int topParent, std::string topName, std::string topPath, size_t depth, AnchorPtr topAnchor)
+      : shared_(shared),
         topPath_(std::move(topPath)),
-        topParent_(std::move(topParent)),
+        topParent_(topParent),
         topName_(std::move(topName)),
-        recursive_(recursive) {}
+        depth_(depth),
+        topAnchor_(std::move(topAnchor)) {}
 
-  // Removes the top item, of the given kind. Returns 0, or -1 with errno.
-  int run(Kind topKind) {
-    if (handleEntry(topParent_.get(), topName_, topKind) == Step::kStop) return -1;
+  // Removes the top item, of the given kind. On a failure that ends the walk
+  // it stops the shared walk.
+  void run(Kind topKind) {
+    if (runSteps(topKind) == Step::kStop) shared_.stop(errno);
+  }
+
+ private:
+  Step runSteps(Kind topKind) {
+    if (handleEntry(topParent_, topName_, topKind) == Step::kStop) return Step::kStop;
     while (!stack_.empty()) {
+      if (shared_.stopped()) return Step::kStop;
       Level& level = stack_.back();
       if (level.next < level.entries.size()) {
         // handleEntry may push a level: work on a copy of the entry.
         Entry entry = std::move(level.entries[level.next++]);
-        Step step = entry.type != DT_UNKNOWN ? handleEntry(level.fd.get(), entry.name, kindOf(entry))
-                                    : handleUnknownEntry(level.fd.get(), entry.name);
-        if (step == Step::kStop) return -1;
+        Step step = entry.type != DT_UNKNOWN ? handleEntry(level.dirFd(), entry.name, kindOf(entry))
+                                             : handleUnknownEntry(level.dirFd(), entry.name);
+        if (step == Step::kStop) return Step::kStop;
         continue;
       }
-      if (finishLevel() == Step::kStop) return -1;
+      if (finishLevel() == Step::kStop) return Step::kStop;
     }
-    return 0;
+    return Step::kGoOn;
   }
 
- private:
   // The path reported for stack_[depth]: the top path, then the names.
   std::string levelPath(size_t depth) const {
     std::string path = topPath_;
@@ -155,16 +363,9 @@ class Walk {
   }
 
   Step report(const std::string& path, int err) {
-    removefile_callback_t callback = state_ != nullptr ? state_->callback : nullptr;
-    if (callback == nullptr) {
-      errno = err;
-      return Step::kStop;
-    }
-    state_->entryErrno = err;
-    int answer = callback(state_, path.c_str(), state_->context);
-    if (answer == REMOVEFILE_PROCEED || answer == REMOVEFILE_SKIP) return Step::kGoOn;
+    Step step = shared_.report(path, err);
     errno = err;
-    return Step::kStop;
+    return step;
   }
 
   Step handleUnknownEntry(int dirFd, const std::string& name) {
@@ -177,10 +378,14 @@ class Walk {
   }
 
   // Removes the entry `name` of dirFd, or enters it when it is a directory of
-  // a recursive walk (it is then removed when its level is finished). The
-  // kind may be stale: one change of kind is followed; a second one is
-  // reported as the failure it is.
+  // a recursive walk (it is then removed when its level is finished), or
+  // hands it off. The kind may be stale: one change of kind is followed; a
+  // second one is reported as the failure it is.
   Step handleEntry(int dirFd, const std::string& name, Kind kind) {
+    if (kind == Kind::kDirectory && !stack_.empty() && shared_.shouldHandOff(depth_ + stack_.size())) {
+      handOff(name);
+      return Step::kGoOn;
+    }
     int err = 0;
     for (int tries = 0; tries < 2; ++tries) {
       Attempt attempt = kind == Kind::kDirectory ? removeDirectory(dirFd, name, err) : removeOther(dirFd, name, err);
@@ -191,15 +396,33 @@ class Walk {
     return report(entryPath(name), err);
   }
 
-  Attempt removeOther(int dirFd, const std::string& name, int& err) {
-    if (unlinkat(dirFd, name.c_str(), 0) == 0) return Attempt::kDone;
+  // Queues the directory `name` of the deepest level as a job.
+  void handOff(const std::string& name) {
+    Level& level = stack_.back();
+    AnchorPtr& anchor = anchorOf(level);
+    anchor->holds.fetch_add(1, std::memory_order_relaxed);
+    shared_.push(Job{anchor, name, entryPath(name), depth_ + stack_.size()});
+  }
+
+  // The anchor of an open level, made on first use; the level's descriptor
+  // moves into it and stays open until the directory is removed.
+  static AnchorPtr& anchorOf(Level& level) {
+    if (!level.anchor) {
+      level.anchor = std::make_shared<Anchor>();
+      level.anchor->fd = std::move(level.fd);
+    }
+    return level.anchor;
+  }
+
+  static Attempt removeOther(int dirFd, const std::string& name, int& err) {
+    if (mut::unlinkat(dirFd, name.c_str(), 0) == 0) return Attempt::kDone;
     err = errno;
     return err == EISDIR ? Attempt::kWrongKind : Attempt::kFailed;
   }
 
   Attempt removeDirectory(int dirFd, const std::string& name, int& err) {
-    if (!recursive_) {
-      if (unlinkat(dirFd, name.c_str(), AT_REMOVEDIR) == 0) return Attempt::kDone;
+    if (!shared_.recursive()) {
+      if (mut::unlinkat(dirFd, name.c_str(), AT_REMOVEDIR) == 0) return Attempt::kDone;
       err = errno;
       return err == ENOTDIR ? Attempt::kWrongKind : Attempt::kFailed;
     }
@@ -216,41 +439,82 @@ class Walk {
       err = errno;
       return removeIfEmpty(dirFd, name);
     }
+    if (!(stack_.empty() && depth_ == 0) && isMountedOn(dirFd, fd.get())) {
+      err = EBUSY;
+      return Attempt::kFailed;
+    }
     err = readDirectoryEntries(fd.get(), entries);
     if (err != 0) {
       fd.reset();
       return removeIfEmpty(dirFd, name);
     }
-    stack_.push_back(Level{std::move(fd), st.st_dev, st.st_ino, name, std::move(entries)});
-    if (stack_.size() - lowestOpen_ > kMaxOpenLevels) stack_[lowestOpen_++].fd.reset();
+    if (depth_ == 0) shared_.noteListed(entries.size());
+    stack_.push_back(Level{std::move(fd), st.st_dev, st.st_ino, name, std::move(entries), 0, nullptr});
+    if (stack_.size() - lowestOpen_ > kMaxOpenLevels) {
+      // An anchored level keeps its descriptor: jobs use it.
+      stack_[lowestOpen_++].fd.reset();
+    }
     if (removefile_test_hook_after_listing != nullptr) {
-      removefile_test_hook_after_listing(stack_.back().fd.get(), levelPath(stack_.size() - 1).c_str());
+      removefile_test_hook_after_listing(stack_.back().dirFd(), levelPath(stack_.size() - 1).c_str());
     }
     return Attempt::kDone;
+  }
+
+  // True when `child` is the root of another mount than `parent`'s. When
+  // the mount identity cannot be read the devices decide.
+  static bool isMountedOn(int parent, int child) {
+    struct statx a;
+    struct statx b;
+    if (statx(parent, "", AT_EMPTY_PATH, STATX_MNT_ID, &a) == 0 &&
+        statx(child, "", AT_EMPTY_PATH, STATX_MNT_ID, &b) == 0 && (a.stx_mask & b.stx_mask & STATX_MNT_ID)) {
+      return a.stx_mnt_id != b.stx_mnt_id;
+    }
+    struct stat pa;
+    struct stat ch;
+    return fstat(parent, &pa) == 0 && fstat(child, &ch) == 0 && pa.st_dev != ch.st_dev;
   }
 
   // A directory that could not be entered is still removed when it is empty
   // (its rmdir needs only the parent's permissions). When that fails too,
   // the reason it could not be entered is the one reported.
   static Attempt removeIfEmpty(int dirFd, const std::string& name) {
-    return unlinkat(dirFd, name.c_str(), AT_REMOVEDIR) == 0 ? Attempt::kDone : Attempt::kFailed;
+    return mut::unlinkat(dirFd, name.c_str(), AT_REMOVEDIR) == 0 ? Attempt::kDone : Attempt::kFailed;
   }
 
   // All entries of the deepest level are handled: remove the directory from
-  // its parent, opening the parent again first if it was evicted.
+  // its parent, opening the parent again first if it was evicted. A
+  // directory with jobs still out is left to the thread that ends the last.
   Step finishLevel() {
     size_t depth = stack_.size() - 1;
-    int parentFd = topParent_.get();
+    int parentFd = topParent_;
     if (depth > 0) {
       Level& parent = stack_[depth - 1];
-      if (!parent.fd && reopenParent(depth) == Step::kStop) return Step::kStop;
-      parentFd = parent.fd.get();
+      if (!parent.fd && !parent.anchor && reopenParent(depth) == Step::kStop) return Step::kStop;
+      parentFd = parent.dirFd();
     }
+    if (stack_.back().anchor) return deferLevel(depth);
     std::string name = std::move(stack_.back().name);
     stack_.pop_back();  // closes the directory before its rmdir
-    if (unlinkat(parentFd, name.c_str(), AT_REMOVEDIR) == 0) return Step::kGoOn;
+    if (mut::unlinkat(parentFd, name.c_str(), AT_REMOVEDIR) == 0) return Step::kGoOn;
     int err = errno;
     return report(depth == 0 ? topPath_ : levelPath(depth - 1) + "/" + name, err);
+  }
+
+  // The deepest level is done with its own entries but has handed work off:
+  // it waits on its parent as an anchor, and is removed on its last release.
+  Step deferLevel(size_t depth) {
+    AnchorPtr anchor = std::move(stack_.back().anchor);
+    anchor->path = levelPath(depth);
+    anchor->name = std::move(stack_.back().name);
+    if (depth > 0) {
+      anchor->parent = anchorOf(stack_[depth - 1]);
+    } else {
+      anchor->parent = topAnchor_;
+    }
+    anchor->parentFd = anchor->parent ? anchor->parent->fd.get() : topParent_;
+    if (anchor->parent) anchor->parent->holds.fetch_add(1, std::memory_order_relaxed);
+    stack_.pop_back();
+    return shared_.release(std::move(anchor));
   }
 
   // Opens stack_[depth - 1] again through ".." of stack_[depth]. The parent
@@ -263,7 +527,7 @@ class Walk {
   // budget meet this, and such a child could not be emptied anyway.
   Step reopenParent(size_t depth) {
     Level& parent = stack_[depth - 1];
-    UniqueFd fd(openat(stack_[depth].fd.get(), "..", O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    UniqueFd fd(openat(stack_[depth].dirFd(), "..", O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
     if (!fd) return Step::kStop;  // errno from openat
     struct stat st;
     if (fstat(fd.get(), &st) != 0) return Step::kStop;
@@ -276,16 +540,45 @@ class Walk {
     return Step::kGoOn;
   }
 
-  removefile_state* state_;
+  Shared& shared_;
   std::string topPath_;
-  UniqueFd topParent_;
+  int topParent_;
   std::string topName_;
-  bool recursive_;
+  size_t depth_;
+  AnchorPtr topAnchor_;
   std::vector<Level> stack_;
-  // Levels [lowestOpen_, stack_.size()) hold open descriptors; those below
-  // were evicted.
+  // Levels [lowestOpen_, stack_.size()) hold open descriptors (or anchors);
+  // those below were evicted, unless anchored.
   size_t lowestOpen_ = 0;
 };
+
+void Shared::startThreads() {
+  tried_ = true;
+  rlimit limit;
+  if (getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur < kParallelMinDescriptors) return;
+  started_ = true;  // before any thread can read it
+  for (unsigned i = 1; i < kWorkers; ++i) {
+    try {
+      threads_.emplace_back([this] {
+        Job job;
+        while (take(job, false)) runJob(std::move(job));
+      });
+    } catch (const std::system_error&) {
+      break;  // the threads started so far share the work
+    }
+  }
+  if (threads_.empty()) started_ = false;  // no other thread reads it then
+}
+
+void Shared::runJob(Job job) {
+  if (!stopped()) {
+    Walk walk(*this, job.anchor->fd.get(), std::move(job.name), std::move(job.path), job.depth, job.anchor);
+    walk.run(Kind::kDirectory);
+  }
+  release(std::move(job.anchor));
+  std::lock_guard<std::mutex> hold(lock_);
+  if (--inFlight_ == 0) wake_.notify_all();
+}
 
 // Splits path into the directory that holds the item and the item's name,
 // and checks the top item. Returns 0 and fills the outputs, or an errno.
@@ -387,12 +680,13 @@ int removefile(const char* path, removefile_state_t state, removefile_flags_t fl
   int result;
   int err;
   {
-    Walk walk(state, std::move(topPath), std::move(parentFd), std::move(name), (flags & REMOVEFILE_RECURSIVE) != 0);
-    result = walk.run(kind);
+    Shared shared(state, (flags & REMOVEFILE_RECURSIVE) != 0);
+    Walk(shared, parentFd.get(), std::move(name), std::move(topPath), 0, nullptr).run(kind);
+    result = shared.finish();
     err = errno;
   }
-  // The walk's destructor closes descriptors and frees memory; the caller
-  // reads the errno of the failure.
+  // Closing descriptors and freeing memory keep errno, but the caller must
+  // read the errno of the failure whatever they do.
   errno = err;
   return result;
 }

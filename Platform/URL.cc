@@ -57,10 +57,16 @@ std::string URL::pathExtension() const {
 
 URL URL::URLByAppendingPathComponent(std::string_view component, bool isDirectory) const {
   if (isNull()) return URL();
-  std::string p = path();
-  if (p != "/") p += '/';
+  const std::string& base = path();
+  std::string p;
+  p.reserve(base.size() + 1 + component.size());
+  p += base;
+  if (base != "/") p += '/';
   p += component;
-  return fileURLWithPath(p, isDirectory);
+  // A plain name after a normalised path leaves nothing to fold; listings
+  // make one URL per entry this way.
+  if (component.empty() || component.find('/') != std::string_view::npos) return fileURLWithPath(p, isDirectory);
+  return URL(std::make_shared<URLNode>(std::move(p), isDirectory));
 }
 
 URL URL::URLByAppendingPathExtension(std::string_view extension) const {

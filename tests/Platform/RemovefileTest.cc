@@ -5,6 +5,8 @@
 #include <sys/resource.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <functional>
 #include <memory>
@@ -177,6 +179,93 @@ TEST(Removefile, TreeChangedDuringTheWalk) {
   }
   EXPECT_TRUE(exists(top));
   EXPECT_TRUE(exists(dir / "d0"));
+}
+
+}  // namespace
+
+namespace {
+
+// A tree large enough to be walked by several threads: the callbacks come
+// one at a time, each directory is reported after what kept it from being
+// empty, links lead nowhere, and a STOP ends every thread's walk.
+TEST(Removefile, LargeTreeWalkedInParallel) {
+  sl::test::TempDir dir(sl::test::TempDir::kShm);
+  ASSERT_EQ(chown(dir.path().c_str(), sl::test::ScopedUnprivileged::kUid, sl::test::ScopedUnprivileged::kGid), 0);
+  writeFile(dir / "outside/precious", "keep");
+  sl::test::ScopedUnprivileged nobody;
+  // Enough entries at the top that the walk turns parallel at once.
+  auto build = [&](const std::string& top, int lockedFrom) {
+    for (int f = 0; f < 520; ++f) writeFile(top + "/t" + std::to_string(f));
+    for (int d = 0; d < 40; ++d) {
+      const std::string sub = top + "/d" + std::to_string(d) + "/e/f";
+      for (int f = 0; f < 24; ++f) writeFile(sub + "/" + std::to_string(f));
+      makeSymlink(dir / "outside", sub + "/link");
+      if (d % 10 == 7 && d >= lockedFrom) {
+        writeFile(sub + "/locked/kept");
+        ASSERT_EQ(chmod((sub + "/locked").c_str(), 0), 0);
+      }
+    }
+  };
+  build(dir / "proceed", 0);
+  build(dir / "stop", 30);
+
+  struct Calls {
+    int answer;
+    std::atomic<int> inside{0};
+    bool overlapped = false;
+    Reports reports{};
+  };
+  auto removeCounting = [](const std::string& top, Calls& calls) {
+    sl::removefile_state_t state = sl::removefile_state_alloc();
+    auto callback = [](sl::removefile_state_t s, const char* path, void* context) {
+      auto* c = static_cast<Calls*>(context);
+      if (c->inside.fetch_add(1) != 0) c->overlapped = true;
+      int err = 0;
+      sl::removefile_state_get(s, sl::REMOVEFILE_STATE_ERRNO, &err);
+      c->reports.emplace_back(path, err);
+      c->inside.fetch_sub(1);
+      return c->answer;
+    };
+    sl::removefile_callback_t function = callback;
+    sl::removefile_state_set(state, sl::REMOVEFILE_STATE_ERROR_CALLBACK, reinterpret_cast<const void*>(function));
+    sl::removefile_state_set(state, sl::REMOVEFILE_STATE_ERROR_CONTEXT, &calls);
+    int result = sl::removefile(top.c_str(), state, sl::REMOVEFILE_RECURSIVE);
+    int err = result != 0 ? errno : 0;
+    sl::removefile_state_free(state);
+    return std::pair(result, err);
+  };
+
+  const std::string top = dir / "proceed";
+  Calls proceed{sl::REMOVEFILE_PROCEED};
+  EXPECT_EQ(removeCounting(top, proceed), std::pair(0, 0));
+  EXPECT_FALSE(proceed.overlapped);
+  // Each locked directory, then each of its ancestors up to the top, which
+  // comes last.
+  Reports expected;
+  for (int d : {7, 17, 27, 37}) {
+    const std::string sub = top + "/d" + std::to_string(d);
+    for (const std::string& path : {sub + "/e/f/locked", sub + "/e/f", sub + "/e", sub})
+      expected.emplace_back(path, path.ends_with("locked") ? EACCES : ENOTEMPTY);
+  }
+  Reports sorted = proceed.reports;
+  ASSERT_FALSE(sorted.empty());
+  EXPECT_EQ(sorted.back(), (std::pair<std::string, int>(top, ENOTEMPTY)));
+  sorted.pop_back();
+  std::sort(sorted.begin(), sorted.end());
+  std::sort(expected.begin(), expected.end());
+  EXPECT_EQ(sorted, expected);
+  for (size_t i = 0; i < proceed.reports.size(); ++i) {
+    for (size_t j = i + 1; j < proceed.reports.size(); ++j)
+      EXPECT_FALSE(proceed.reports[j].first.starts_with(proceed.reports[i].first + "/")) << "parent reported first";
+  }
+  EXPECT_TRUE(exists(top + "/d37/e/f/locked"));
+  for (const char* gone : {"/d0", "/d37/e/f/0", "/d37/e/f/link"}) EXPECT_FALSE(exists(top + gone)) << gone;
+  EXPECT_EQ(readFile(dir / "outside/precious"), "keep");
+
+  Calls stop{sl::REMOVEFILE_STOP};
+  EXPECT_EQ(removeCounting(dir / "stop", stop), std::pair(-1, EACCES));
+  ASSERT_EQ(stop.reports.size(), 1u);
+  EXPECT_EQ(stop.reports[0].first, dir / "stop/d37/e/f/locked");
 }
 
 }  // namespace
