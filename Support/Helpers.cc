@@ -66,7 +66,7 @@ bool SLBooleanValue(const sl::Value& object, bool defaultValue) {
         case sl::Number::Type::Unsigned: return number.uint64Value() != 0;
         case sl::Number::Type::Real: return number.doubleValue() != 0.0;
       }
-      return defaultValue;
+      return defaultValue;  // GCOVR_EXCL_LINE: every type returns above; this only quiets -Wreturn-type
     }
     default:
       return defaultValue;

@@ -9,6 +9,7 @@
 
 #include "FileManager/SLFileManager.h"
 #include "Platform/DataProtection.h"
+#include "Platform/Mutations.h"
 #include "Platform/UniqueFd.h"
 #include "Support/Errors.h"
 #include "TestSupport/TestSupport.h"
@@ -185,6 +186,49 @@ TEST_F(CrossVolume, MoveCopiesThenRemovesOrLogsSource) {
                    installerLine(3, kMove,
                                  "Failed to remove move source after copy at " + stuck + " : " + removal.description()),
                    refused}));
+}
+
+// A move that is made but cannot be flushed, or whose fallback copy cannot
+// be made or flushed, fails; a source that was copied stays until its copy
+// is on disk.
+TEST_F(CrossVolume, MovesThatFailHalfwayKeepTheCopiedSource) {
+  if (!sl::mut::kFaultInjectionBuilt) GTEST_SKIP() << "a build without fault plans";
+  makeDirs(shm / "to");
+  const std::string eio = " failed: Input/output error";
+  const struct {
+    const char* plan;
+    std::string from, to;
+    bool sourceStays;
+    int code;
+    const char* function;
+    std::string message;
+  } cases[] = {
+      // One volume: the rename stands; the destination's directory is
+      // flushed first, then the source's.
+      {"EIO@1:sync", shm / "a", shm / "to/a", false, EIO, kMove,
+       "rename of " + url(shm / "a") + " to " + url(shm / "to/a") + " is not durable: fsync of " + shm / "to" + eio},
+      {"EIO@2:sync", shm / "b", shm / "to/b", false, EIO, kMove,
+       "rename of " + url(shm / "b") + " to " + url(shm / "to/b") + " is not durable: fsync of " + shm.path() + eio},
+      // Across volumes: the copy is made but not flushed.
+      {"EIO@1:sync", shm / "c", disk / "c", true, EIO, kMove,
+       "copy of " + url(shm / "c") + " to " + url(disk / "c") + " is not durable: fsync of " + disk / "c" + eio},
+      // The fallback copy itself fails: its record is the move's.
+      {"EXDEV@1:rename", shm / "d", shm / "missing/d", true, ENOENT, kCopy,
+       "copyfile of " + url(shm / "d") + " to " + url(shm / "missing/d") + " failed: No such file or directory"},
+  };
+  LogCapture log;
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.message);
+    writeFile(c.from, "data");
+    sl::Error err;
+    ASSERT_TRUE(sl::mut::setPlanForTesting(c.plan));
+    EXPECT_FALSE(fm().moveItemAtURL(fileURL(c.from), fileURL(c.to), &err));
+    sl::mut::setPlanForTesting("");
+    expectPOSIXRecord(err, c.code, c.message, c.function);
+    EXPECT_EQ(exists(c.from), c.sourceStays);
+    EXPECT_EQ(exists(c.to), c.code == EIO);
+  }
+  EXPECT_EQ(log.installer(), Lines{});
 }
 
 TEST(CreateCopyMove, TemporaryDirectories) {

@@ -55,6 +55,11 @@ TEST(ListingAndRemoval, RemoveTreesLinksVanishedAbsentAndNull) {
   err = sentinel;
   EXPECT_TRUE(fm().removeItemAtURL(fileURL(tmp / "tree", true), &err));
   EXPECT_EQ(err, sentinel);
+  // A path that cannot name anything is not "nothing there".
+  writeFile(tmp / "file");
+  EXPECT_FALSE(fm().removeItemAtURL(fileURL(tmp / "file/x"), &err));
+  expectPOSIXRecord(err, ENOTDIR, "removefile of file://" + tmp / "file/x" + " failed: Not a directory", kRemove);
+  EXPECT_TRUE(exists(tmp / "file"));
 
   EXPECT_FALSE(fm().removeItemAtURL(nullptr, &err));
   expectPOSIXRecord(err, EFAULT, "nil url passed to -removeItemAtURL:error:", kRemove);

@@ -1,8 +1,11 @@
+#include <sys/xattr.h>
+
 #include <cerrno>
 
 #include <gtest/gtest.h>
 
 #include "FileManager/SLFileManager.h"
+#include "Platform/DataProtection.h"
 #include "TestSupport/TestSupport.h"
 
 namespace {
@@ -49,6 +52,25 @@ TEST(ProtectionClasses, ReadSetPredicateAndRefusals) {
   expectPOSIXRecord(err, ELOOP, refused, kGet);
   EXPECT_FALSE(fm().setDataProtectionClassOfItemAtURL(fileURL(tmp / "link"), 5, nullptr, &err));
   expectPOSIXRecord(err, ELOOP, refused, kSet);
+
+  // A class attribute that this code did not write (a value out of range, a
+  // wrong length) is no class: reading fails, and so does a conditional set,
+  // before its predicate is asked and without touching the attribute.
+  for (const std::string& stored : {std::string("\x09\0\0\0", 4), std::string("\x04\0", 2)}) {
+    SCOPED_TRACE(stored.size());
+    ASSERT_EQ(setxattr((tmp / "file").c_str(), sl::kProtectionClassAttribute, stored.data(), stored.size(), 0), 0);
+    const std::string bad = "Failed to getclass of file " + tmp / "file" + ": Invalid argument";
+    EXPECT_FALSE(fm().dataProtectionClassOfItemAtURL(fileURL(tmp / "file"), &protectionClass, &err));
+    expectPOSIXRecord(err, EINVAL, bad, kGet);
+    bool asked = false;
+    EXPECT_FALSE(fm().setDataProtectionClassOfItemAtURL(
+        fileURL(tmp / "file"), 2, [&](int32_t) { return asked = true; }, &err));
+    expectPOSIXRecord(err, EINVAL, bad, kSet);
+    EXPECT_FALSE(asked);
+    char now[8] = {};
+    EXPECT_EQ(getxattr((tmp / "file").c_str(), sl::kProtectionClassAttribute, now, sizeof now), ssize_t(stored.size()));
+    EXPECT_EQ(std::string(now, stored.size()), stored);
+  }
 
   // A fifo without a writer opens at once (a hang here is the failure).
   ASSERT_EQ(::mkfifo((tmp / "fifo").c_str(), 0644), 0);

@@ -1,6 +1,7 @@
 #include "Platform/PropertyList.h"
 
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <cmath>
 #include <limits>
@@ -204,6 +205,10 @@ TEST(PropertyListTest, WritersRefuseWhatTheirFormatCannotCarry) {
       {"control character", Array{String("bell\x07")}, EILSEQ, 0},
       {"control character in key", Dictionary{{"nul\x01", Boolean(true)}}, EILSEQ, 0},
       {"noncharacter", String("\xEF\xBF\xBF"), EILSEQ, 0},
+      {"cut sequence", String("a\xE2\x82"), EILSEQ, 0},
+      {"overlong, three bytes", String("\xE0\x9F\xBF"), EILSEQ, 0},
+      {"overlong, four bytes", String("\xF0\x8F\xBF\xBF"), EILSEQ, 0},
+      {"above U+10FFFF", String("\xF4\x90\x80\x80"), EILSEQ, 0},
       {"date past year 9999", Date(1e12), EINVAL, 0},
       {"URL", Array{fileURL("/x")}, EINVAL, EINVAL},
       {"error record", Dictionary{{"e", Error::posix(EIO)}}, EINVAL, EINVAL},
@@ -402,6 +407,13 @@ TEST(PropertyListTest, FilesThatHoldNoDictionary) {
                           nullptr);
   EXPECT_FALSE(readFileContents(fileURL(dir / "directory.plist"), &bytes, &error));
   test::expectPOSIXRecord(error, EISDIR, "read of " + (dir / "directory.plist") + " failed: Is a directory", nullptr);
+  // A fifo or a device where a file is expected is refused, not read (a
+  // hang here is the failure).
+  ASSERT_EQ(mkfifo((dir / "fifo.plist").c_str(), 0644), 0);
+  for (const std::string& path : {dir / "fifo.plist", std::string("/dev/zero")}) {
+    EXPECT_FALSE(readFileContents(fileURL(path), &bytes, &error));
+    test::expectPOSIXRecord(error, EINVAL, "read of " + path + " failed: not a regular file", nullptr);
+  }
   {
     test::ScopedUnprivileged nobody;
     EXPECT_FALSE(readFileContents(fileURL(dir / "secret.plist"), &bytes, &error));

@@ -80,6 +80,18 @@ TEST_F(InfoPlist, FailuresAndTheirLines) {
              line(sl::kLogLevelError, "PBBundleGetInfoDictionary failed for bundle " + arrayBundle.absoluteString()),
              line(sl::kLogLevelError, "Failed to get filtered Info.plist with keys " + keys.description() +
                                           " from bundle " + fileURL(tmp_ / "Bad.app", true).absoluteString())}));
+
+  // ---- A bundle path that names a file: the Info.plist's absence cannot be
+  // told, so the bundle is tried, and refused ----
+  sl::test::writeFile(tmp_ / "File.app");
+  const sl::URL fileBundle = fileURL(tmp_ / "File.app", true);
+  log_.clear();
+  EXPECT_TRUE(SLLoadInfoPlist(fileBundle, keys).isNull());
+  EXPECT_EQ(log_.installer(),
+            (Lines{sl::test::installerLine(sl::kLogLevelError, "-[SLFileManager itemDoesNotExistAtURL:]",
+                                           "Failed to determine if " + fileBundle.absoluteString() +
+                                               "Info.plist exists: Not a directory"),
+                   line(sl::kLogLevelError, "Failed to create PBBundle from URL " + fileBundle.absoluteString())}));
 }
 
 }  // namespace
