@@ -62,10 +62,6 @@ class InstallationTest : public mgtest::MigratorTest {
   static LogCapture::Line line(int level, const char* function, const std::string& message) {
     return {level, "Movanta", function, "SLAppMigrator: " + message};
   }
-  static void builtIn(const std::string& identifier, const std::string& version) {
-    mgtest::makeBundle(below("/Applications/Builtin.app"), identifier, version);
-    SLGlobalConfiguration::sharedInstance().reScanSystemApps();
-  }
   const std::string c_ = below(mgtest::kOldRoot) + "/C";
   std::shared_ptr<RecordingWorkspace> recorder_;
   std::unique_ptr<SLAppMigrator> migrator_ = Access::bare();
@@ -205,7 +201,8 @@ TEST_F(InstallationTest, InstallsPlaceholders) {
   // The registry refuses (never over a built-in application): the record's
   // user-info is logged, the staged directory goes.
   fresh();
-  builtIn("com.ex.p", "1");
+  mgtest::makeBundle(below("/Applications/Builtin.app"), "com.ex.p", "1");
+  SLGlobalConfiguration::sharedInstance().reScanSystemApps();
   makePlaceholderSource(bundle, true);
   EXPECT_FALSE(install());
   ASSERT_EQ(lines().size(), 2u);
@@ -307,13 +304,13 @@ TEST_F(InstallationTest, MigratesGroupContainers) {
 TEST(FileDataTest, ReadFailuresCarryTheFileDomain) {
   sl::test::TempDir dir;
   sl::test::writeFile(dir / "secret", "x", 0600);
-  sl::Error missing, refused;
-  EXPECT_TRUE(sl::dataWithContentsOfURL(fileURL(dir / "missing"), &missing).isNull());
   sl::test::ScopedUnprivileged nobody;
-  EXPECT_TRUE(sl::dataWithContentsOfURL(fileURL(dir / "secret"), &refused).isNull());
-  EXPECT_EQ(missing.domain() + std::to_string(missing.code()), "FileErrorDomain260");
-  EXPECT_EQ(refused.domain() + std::to_string(refused.code()), "FileErrorDomain257");
-  EXPECT_TRUE(missing.underlyingError().isPOSIX(ENOENT) && refused.underlyingError().isPOSIX(EACCES));
+  for (const auto& [name, code, posix] : {std::tuple("missing", 260, ENOENT), std::tuple("secret", 257, EACCES)}) {
+    sl::Error error;
+    EXPECT_TRUE(sl::dataWithContentsOfURL(fileURL(dir / name), &error).isNull());
+    EXPECT_EQ(error.domain() + std::to_string(error.code()), "FileErrorDomain" + std::to_string(code));
+    EXPECT_TRUE(error.underlyingError().isPOSIX(posix)) << name;
+  }
 }
 
 }  // namespace

@@ -1,6 +1,5 @@
-// The migrator's start-up state, the main pass over the old container root,
-// and the plug-in's entry points as the host uses them.
-#include <dlfcn.h>
+// The migrator's start-up state and the main pass over the old container
+// root (the plug-in's entry points are exercised by the program's tests).
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
@@ -213,11 +212,10 @@ TEST_F(StartupAndMainPassTest, OneContainerEndToEnd) {
   const std::string c = oldRoot() + "/C", group = below("/private/var/mobile/OldGroups/G");
   const sl::String identifier("com.example.a");
   makeBundle(c + "/A.app", identifier.str(), "1.0", {"group.example.g"});
-  for (const char* item : {"Documents", "Library", "tmp", "Tillbox"})
-    sl::test::writeFile(c + "/" + item + "/file", item);
+  const char* const dataItems[] = {"Documents", "Library", "tmp", "Tillbox"};
+  for (const char* item : dataItems) sl::test::writeFile(c + "/" + item + "/file", item);
   // Marker-family names are no leftovers.
-  for (const char* name : {"com.vantor.stowline.migration_marker", "com.vantor.stowline.placeholder"})
-    sl::test::writeFile(c + "/" + name);
+  for (const char* name : {"migration_marker", "placeholder"}) sl::test::writeFile(c + "/com.vantor.stowline." + name);
   sl::test::writeFile(group + "/shared", "group data");
   writeInstallMap({{"group.example.g", group}});
   writeOSRelease();
@@ -229,8 +227,7 @@ TEST_F(StartupAndMainPassTest, OneContainerEndToEnd) {
   ASSERT_TRUE(proxy);
   EXPECT_EQ(proxy->bundleType().str(), "User");
   const std::string dataContainer = proxy->dataContainerURL().path();
-  for (const char* item : {"Documents", "Library", "tmp", "Tillbox"})
-    EXPECT_EQ(sl::test::readFile(dataContainer + "/" + item + "/file"), item);
+  for (const char* item : dataItems) EXPECT_EQ(sl::test::readFile(dataContainer + "/" + item + "/file"), item);
   const sl::Dictionary info =
       sl::dictionaryWithContentsOfURL(proxy->bundleURL().URLByAppendingPathComponent("Info.plist", false));
   EXPECT_EQ(info.get("PBBundleIdentifier").asString(), "com.example.a");
@@ -252,19 +249,6 @@ TEST_F(StartupAndMainPassTest, OneContainerEndToEnd) {
                                       " (and secondary (null))",
                                   "Removing container for com.example.a at " + u(c, true)})
     EXPECT_NE(std::find(lines.begin(), lines.end(), Line{N, "SLAppMigrator: " + line}), lines.end()) << line;
-}
-
-TEST_F(StartupAndMainPassTest, HostLoadsThePlugIn) {
-  void* handle = dlopen(SL_PLUGIN_PATH, RTLD_NOW | RTLD_LOCAL);
-  ASSERT_NE(handle, nullptr) << dlerror();
-  auto create = reinterpret_cast<DataClassMigratorCreateFunction>(dlsym(handle, kDataClassMigratorEntryPoint));
-  auto release = reinterpret_cast<DataClassMigratorReleaseFunction>(dlsym(handle, kDataClassMigratorReleasePoint));
-  ASSERT_TRUE(create && release);
-  DataClassMigrator* migrator = create();
-  ASSERT_NE(migrator, nullptr);
-  EXPECT_EQ(migrator->dataClassName(), "SLAppMigrator");
-  release(migrator);
-  dlclose(handle);
 }
 
 }  // namespace

@@ -7,10 +7,12 @@
 
 #include <algorithm>
 #include <atomic>
+#include <chrono>
 #include <cerrno>
 #include <functional>
 #include <memory>
 #include <string>
+#include <thread>
 #include <tuple>
 #include <vector>
 
@@ -31,27 +33,39 @@ using Reports = std::vector<std::pair<std::string, int>>;
 using Outcome = std::tuple<int, int, Reports>;
 constexpr int kNoCallback = -1;
 
+struct Calls {
+  int answer;
+  std::atomic<int> inside{0};
+  bool overlapped = false;
+  Reports reports{};
+};
+
 int record(sl::removefile_state_t state, const char* path, void* context) {
+  auto* calls = static_cast<Calls*>(context);
+  if (calls->inside.fetch_add(1) != 0) calls->overlapped = true;
   int err = -1;
   EXPECT_EQ(sl::removefile_state_get(state, sl::REMOVEFILE_STATE_ERRNO, &err), 0);
-  auto* outcome = static_cast<Outcome*>(context);
-  std::get<2>(*outcome).emplace_back(path, err);
-  return std::get<1>(*outcome);  // the answer, until removefile returns
+  calls->reports.emplace_back(path, err);
+  std::this_thread::sleep_for(std::chrono::milliseconds(2));  // widens the window for an overlap
+  calls->inside.fetch_sub(1);
+  return calls->answer;
 }
 
-// Removes path with a callback that answers `answer` (or without one).
+// Removes path with a callback that answers `answer` (or without one); the
+// callbacks must come one at a time.
 Outcome removeWith(const std::string& path, int answer = sl::REMOVEFILE_PROCEED,
                    sl::removefile_flags_t flags = sl::REMOVEFILE_RECURSIVE) {
   std::unique_ptr<sl::removefile_state, int (*)(sl::removefile_state_t)> state(sl::removefile_state_alloc(),
                                                                                &sl::removefile_state_free);
-  Outcome outcome{0, answer, {}};
+  Calls calls{answer};
   if (answer != kNoCallback) {
     sl::removefile_state_set(state.get(), sl::REMOVEFILE_STATE_ERROR_CALLBACK, reinterpret_cast<const void*>(&record));
-    sl::removefile_state_set(state.get(), sl::REMOVEFILE_STATE_ERROR_CONTEXT, &outcome);
+    sl::removefile_state_set(state.get(), sl::REMOVEFILE_STATE_ERROR_CONTEXT, &calls);
   }
-  std::get<0>(outcome) = sl::removefile(path.c_str(), state.get(), flags);
-  std::get<1>(outcome) = std::get<0>(outcome) != 0 ? errno : 0;
-  return outcome;
+  const int result = sl::removefile(path.c_str(), state.get(), flags);
+  const int err = result != 0 ? errno : 0;
+  EXPECT_FALSE(calls.overlapped) << "callbacks overlapped";
+  return {result, err, calls.reports};
 }
 
 // Runs `hook` right after each directory of the walk is listed, while alive.
@@ -181,10 +195,6 @@ TEST(Removefile, TreeChangedDuringTheWalk) {
   EXPECT_TRUE(exists(dir / "d0"));
 }
 
-}  // namespace
-
-namespace {
-
 // A tree large enough to be walked by several threads: the callbacks come
 // one at a time, each directory is reported after what kept it from being
 // empty, links lead nowhere, and a STOP ends every thread's walk.
@@ -209,36 +219,9 @@ TEST(Removefile, LargeTreeWalkedInParallel) {
   build(dir / "proceed", 0);
   build(dir / "stop", 30);
 
-  struct Calls {
-    int answer;
-    std::atomic<int> inside{0};
-    bool overlapped = false;
-    Reports reports{};
-  };
-  auto removeCounting = [](const std::string& top, Calls& calls) {
-    sl::removefile_state_t state = sl::removefile_state_alloc();
-    auto callback = [](sl::removefile_state_t s, const char* path, void* context) {
-      auto* c = static_cast<Calls*>(context);
-      if (c->inside.fetch_add(1) != 0) c->overlapped = true;
-      int err = 0;
-      sl::removefile_state_get(s, sl::REMOVEFILE_STATE_ERRNO, &err);
-      c->reports.emplace_back(path, err);
-      c->inside.fetch_sub(1);
-      return c->answer;
-    };
-    sl::removefile_callback_t function = callback;
-    sl::removefile_state_set(state, sl::REMOVEFILE_STATE_ERROR_CALLBACK, reinterpret_cast<const void*>(function));
-    sl::removefile_state_set(state, sl::REMOVEFILE_STATE_ERROR_CONTEXT, &calls);
-    int result = sl::removefile(top.c_str(), state, sl::REMOVEFILE_RECURSIVE);
-    int err = result != 0 ? errno : 0;
-    sl::removefile_state_free(state);
-    return std::pair(result, err);
-  };
-
   const std::string top = dir / "proceed";
-  Calls proceed{sl::REMOVEFILE_PROCEED};
-  EXPECT_EQ(removeCounting(top, proceed), std::pair(0, 0));
-  EXPECT_FALSE(proceed.overlapped);
+  const auto [result, err, reports] = removeWith(top);
+  EXPECT_EQ(std::pair(result, err), std::pair(0, 0));
   // Each locked directory, then each of its ancestors up to the top, which
   // comes last.
   Reports expected;
@@ -247,25 +230,23 @@ TEST(Removefile, LargeTreeWalkedInParallel) {
     for (const std::string& path : {sub + "/e/f/locked", sub + "/e/f", sub + "/e", sub})
       expected.emplace_back(path, path.ends_with("locked") ? EACCES : ENOTEMPTY);
   }
-  Reports sorted = proceed.reports;
+  Reports sorted = reports;
   ASSERT_FALSE(sorted.empty());
   EXPECT_EQ(sorted.back(), (std::pair<std::string, int>(top, ENOTEMPTY)));
   sorted.pop_back();
   std::sort(sorted.begin(), sorted.end());
   std::sort(expected.begin(), expected.end());
   EXPECT_EQ(sorted, expected);
-  for (size_t i = 0; i < proceed.reports.size(); ++i) {
-    for (size_t j = i + 1; j < proceed.reports.size(); ++j)
-      EXPECT_FALSE(proceed.reports[j].first.starts_with(proceed.reports[i].first + "/")) << "parent reported first";
+  for (size_t i = 0; i < reports.size(); ++i) {
+    for (size_t j = i + 1; j < reports.size(); ++j)
+      EXPECT_FALSE(reports[j].first.starts_with(reports[i].first + "/")) << "parent reported first";
   }
   EXPECT_TRUE(exists(top + "/d37/e/f/locked"));
   for (const char* gone : {"/d0", "/d37/e/f/0", "/d37/e/f/link"}) EXPECT_FALSE(exists(top + gone)) << gone;
   EXPECT_EQ(readFile(dir / "outside/precious"), "keep");
 
-  Calls stop{sl::REMOVEFILE_STOP};
-  EXPECT_EQ(removeCounting(dir / "stop", stop), std::pair(-1, EACCES));
-  ASSERT_EQ(stop.reports.size(), 1u);
-  EXPECT_EQ(stop.reports[0].first, dir / "stop/d37/e/f/locked");
+  EXPECT_EQ(removeWith(dir / "stop", sl::REMOVEFILE_STOP),
+            (Outcome{-1, EACCES, {{dir / "stop/d37/e/f/locked", EACCES}}}));
 }
 
 }  // namespace
