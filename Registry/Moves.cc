@@ -100,6 +100,14 @@ bool moveIntoContainer(const Move& move, sl::Error* error) {
 }
 
 bool undoMove(const Move& move, sl::Error* error) {
+  // The package is its owner's to remove once the install call has returned,
+  // whatever the outcome: after an undo that failed there, the owner may
+  // have removed it before the next open finishes the undo. With nowhere
+  // left to bring the item back to, it goes instead, as the package would
+  // have.
+  if (!present(parentOf(move.source))) {
+    return removeTree(move.destination, error) && removeTree(trashPathFor(move.source), error);
+  }
   if (!present(move.source) && present(move.destination)) {
     int renameErrno = 0;
     if (!renameItem(move.destination, move.source, &renameErrno)) {

@@ -26,7 +26,9 @@ bool moveIntoContainer(const Move& move, sl::Error* error);
 // Brings the source back when it is gone and the destination is there
 // (rename, or across volumes a copy to ".NAME.rgrestore" beside the source
 // renamed into place), then removes the trash. A source that is there is
-// whole and is left alone. The destination's container is not removed here.
+// whole and is left alone. When the source's directory is gone (the
+// package's owner removed the package), the destination is removed instead.
+// The destination's container is not removed here.
 bool undoMove(const Move& move, sl::Error* error);
 
 // Removes a tree; absent (ENOENT, or ENOTDIR on the way) is success.

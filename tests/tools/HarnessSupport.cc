@@ -5,10 +5,13 @@
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <map>
 #include <sstream>
 
+#include "Platform/PropertyList.h"
 #include "tools/ProgramRunner.h"
 
 namespace sl::harness {
@@ -88,6 +91,117 @@ std::string plainPath(std::string text) {
   return text;
 }
 
+// The identifiers whose bundle install failed in a migration's log, with
+// their bundle paths: within the section that a "Migrating ID at BUNDLE"
+// line opens, one of the messages with which staging and installing the
+// bundle gives up (the migrator treats a failed staging as a failed
+// install: the data has moved, the container goes).
+std::map<std::string, std::string> failedBundleInstalls(const std::string& log) {
+  static constexpr char kMigrating[] = "SLAppMigrator: Migrating ";
+  static constexpr const char* kGaveUp[] = {
+      "SLAppMigrator: Failed to install ", "SLAppMigrator: Failed to create ",
+      "SLAppMigrator: Failed to move bundle from ", "SLAppMigrator: Failed to move vpn bundle from ",
+      "SLAppMigrator: Failed to move app metadata from "};
+  std::map<std::string, std::string> failed;
+  std::string identifier, bundle;
+  for (const std::string& line : lines(log)) {
+    if (const size_t at = line.find(kMigrating); at != std::string::npos) {
+      const std::string rest = line.substr(at + std::strlen(kMigrating));
+      const size_t separator = rest.find(" at ");
+      // "Migrating group container ..." and "Migrating safe harbor ..." do
+      // not open an application's section.
+      if (separator == std::string::npos || rest.find(' ') != separator) {
+        identifier.clear();
+        continue;
+      }
+      identifier = rest.substr(0, separator);
+      bundle = plainPath(rest.substr(separator + 4));
+    } else if (!identifier.empty() && line.find("-[SLAppMigrator _stageAndInstallBundleAtURL:") != std::string::npos &&
+               std::any_of(std::begin(kGaveUp), std::end(kGaveUp),
+                           [&](const char* message) { return line.find(message) != std::string::npos; })) {
+      failed[identifier] = bundle;
+    }
+  }
+  return failed;
+}
+
+// The flat object of strings under `key` in the manifest's JSON (the
+// program writes "/" unescaped and no other escapes into paths and group
+// names); empty when it is not there.
+std::map<std::string, std::string> stringObject(const std::string& json, const std::string& key) {
+  std::map<std::string, std::string> out;
+  size_t at = json.find("\"" + key + "\":{");
+  if (at == std::string::npos) return out;
+  at += key.size() + 4;
+  auto readString = [&](std::string* value) {
+    if (at >= json.size() || json[at] != '"') return false;
+    value->clear();
+    for (++at; at < json.size() && json[at] != '"'; ++at) {
+      if (json[at] == '\\' && at + 1 < json.size()) ++at;
+      value->push_back(json[at]);
+    }
+    return at++ < json.size();
+  };
+  std::string name, value;
+  while (readString(&name) && at < json.size() && json[at++] == ':' && readString(&value)) {
+    out[name] = value;
+    if (at >= json.size() || json[at] != ',') break;
+    ++at;
+  }
+  return out;
+}
+
+// What differs between the item at `relative` below `want` (pristine) and
+// below `have`: type, permission bits, size, bytes or link target. Empty
+// when they agree.
+std::string itemDifference(const std::string& want, const std::string& have, const std::string& relative) {
+  struct stat a, b;
+  const std::string wanted = want + "/" + relative, found = have + "/" + relative;
+  if (::lstat(wanted.c_str(), &a) != 0) return "unreadable in the pristine copy";
+  if (::lstat(found.c_str(), &b) != 0) {
+    const int lstatErrno = errno;
+    return std::string("not at its old path: ") + std::strerror(lstatErrno);
+  }
+  if ((a.st_mode & S_IFMT) != (b.st_mode & S_IFMT)) return "its type changed";
+  if ((a.st_mode & 07777) != (b.st_mode & 07777)) return "its mode changed";
+  if (S_ISREG(a.st_mode) && (a.st_size != b.st_size || slurp(wanted) != slurp(found))) return "its content changed";
+  if (S_ISLNK(a.st_mode)) {
+    std::error_code ec1, ec2;
+    if (std::filesystem::read_symlink(wanted, ec1) != std::filesystem::read_symlink(found, ec2)) {
+      return "its target changed";
+    }
+  }
+  return {};
+}
+
+// True when every migration that `rerun` reports failed is of a container
+// whose removal the `faulty` run logged as failed, and failed at the
+// install of its bundle (which that removal had already taken).
+bool rerunFailedOnlyOnPartlyRemovedContainers(const std::string& faulty, const std::string& rerun) {
+  static constexpr char kFailed[] = "SLAppMigrator: Migration of ";
+  const std::map<std::string, std::string> installs = failedBundleInstalls(rerun);
+  bool any = false;
+  for (const std::string& line : lines(rerun)) {
+    const size_t at = line.find(kFailed);
+    if (at == std::string::npos) continue;
+    const size_t start = at + std::strlen(kFailed);
+    const size_t bundleAt = line.find(" at ", start);
+    const size_t end = line.rfind(" failed");
+    if (bundleAt == std::string::npos || end == std::string::npos || end < bundleAt) return false;
+    const std::string identifier = line.substr(start, bundleAt - start);
+    const std::string bundle = line.substr(bundleAt + 4, end - bundleAt - 4);
+    const std::string container = bundle.substr(0, bundle.rfind('/'));
+    const std::string removalFailed = "SLAppMigrator: Failed to remove container file://" + container + "/ : ";
+    const std::string nothingStaged = "Package " + container + "/Staging holds no application in Payload";
+    if (installs.count(identifier) == 0 || faulty.find(removalFailed) == std::string::npos ||
+        rerun.find(nothingStaged) == std::string::npos) {
+      return false;
+    }
+    any = true;
+  }
+  return any;
+}
+
 }  // namespace
 
 std::vector<uint64_t> samplePoints(uint64_t total, uint64_t stride, uint64_t seed) {
@@ -158,11 +272,35 @@ std::string Harness::describe(const std::string& headline, const std::vector<Ste
   return text;
 }
 
-std::string Harness::checkMigrated() {
+std::string Harness::checkMigrated(const LeftBehind& left) {
   std::string problems;
   const test::ProgramResult verify = test::runProgram({config_.stowline, "verify", "--root", root_, manifest_},
                                                       {"NO_COLOR", "STOWLINE_ROOT", "STOWLINE_FAULT", "STOWLINE_FAULT_TRACE"});
-  if (verify.status != 0) problems += "verify: status " + std::to_string(verify.status) + "\n" + tail(verify.out, 4000) + verify.err;
+  if (verify.status != 0) {
+    // Lines "KIND: group OWNER: PATH: DETAIL", then the summary. An item
+    // left behind may be missing from the new layout and, for the same
+    // reason, still in the old one ("duplicated"); nothing else.
+    std::string unexpected;
+    const std::vector<std::string> reported = lines(verify.out);
+    for (size_t i = 0; i + 1 < reported.size(); ++i) {
+      const std::string& line = reported[i];
+      const size_t kindEnd = line.find(": group ");
+      const std::string kind = kindEnd == std::string::npos ? std::string() : line.substr(0, kindEnd);
+      const size_t ownerEnd = kind.empty() ? std::string::npos : line.find(": ", kindEnd + 8);
+      bool accepted = false;
+      if (verify.status == 1 && (kind == "missing" || kind == "duplicated") && ownerEnd != std::string::npos) {
+        const auto group = left.find(line.substr(kindEnd + 8, ownerEnd - kindEnd - 8));
+        const std::string path = line.substr(ownerEnd + 2);
+        accepted = group != left.end() &&
+                   (group->second.empty() || group->second.count(path.substr(0, path.find_first_of("/:"))) != 0);
+      }
+      if (!accepted) unexpected += line + "\n";
+    }
+    if (!unexpected.empty() || verify.status != 1 || reported.empty()) {
+      problems += "verify: status " + std::to_string(verify.status) + "\n" +
+                  tail(unexpected.empty() ? verify.out : unexpected, 4000) + verify.err;
+    }
+  }
 
   sqlite3* raw = nullptr;
   const std::string database = root_ + kDatabase;
@@ -184,13 +322,18 @@ std::string Harness::checkMigrated() {
   for (const char* directory : kContainerRoots) counts.push_back(countEntries(root_ + directory));
   if (baseline_.empty()) {
     baseline_ = counts;
-  } else if (counts != baseline_) {
+  } else {
+    const auto whole = std::count_if(left.begin(), left.end(), [](const auto& group) { return group.second.empty(); });
+    std::vector<int64_t> expected = baseline_;
+    expected[1] -= whole;  // groups
+    expected[5] -= whole;  // group containers
     static const char* const kNames[] = {"applications", "groups", "safe harbors", "bundle containers",
                                          "data containers", "group containers"};
     for (size_t i = 0; i < counts.size(); ++i) {
-      if (counts[i] != baseline_[i]) {
-        problems += std::string(kNames[i]) + ": " + std::to_string(counts[i]) + ", the clean run has " +
-                    std::to_string(baseline_[i]) + "\n";
+      if (counts[i] != expected[i]) {
+        problems += std::string(kNames[i]) + ": " + std::to_string(counts[i]) + ", expected " +
+                    std::to_string(expected[i]) + " as after the clean run" +
+                    (whole == 0 ? "" : " less the groups left behind") + "\n";
       }
     }
   }
@@ -220,6 +363,69 @@ std::string Harness::checkMarkers(const std::string& log) {
   return problems;
 }
 
+std::string Harness::compareWithPristine(const std::string& old, const std::string& relative) {
+  const std::string pristine = pristine_ + old.substr(root_.size());
+  std::string wrong;
+  auto compare = [&](const std::string& item) {
+    if (const std::string why = itemDifference(pristine, old, item); !why.empty()) {
+      wrong += "  " + item + ": " + why + "\n";
+    }
+  };
+  if (!relative.empty()) compare(relative);
+  const std::string top = relative.empty() ? pristine : pristine + "/" + relative;
+  std::error_code ec;
+  if (!relative.empty() && !std::filesystem::is_directory(std::filesystem::symlink_status(top, ec))) return wrong;
+  for (std::filesystem::recursive_directory_iterator it(top, ec), end; !ec && it != end; it.increment(ec)) {
+    compare(it->path().string().substr(pristine.size() + 1));
+  }
+  if (ec) wrong += "  cannot list " + top + ": " + ec.message() + "\n";
+  return wrong;
+}
+
+void Harness::addStrandedGroups(const std::string& log, LeftBehind* left, std::string* problems) {
+  for (const auto& [identifier, bundle] : failedBundleInstalls(log)) {
+    if (bundle.rfind(root_ + "/", 0) != 0) continue;
+    const std::string info = pristine_ + bundle.substr(root_.size()) + "/Info.plist";
+    const sl::Array groups =
+        sl::dictionaryWithContentsOfURL(sl::URL::fileURLWithPath(info, false)).get("PBApplicationGroups").asArray();
+    if (groups.isNull()) continue;
+    for (const sl::Value& value : groups) {
+      const std::string group = value.asString().isNull() ? std::string() : value.asString().str();
+      const auto old = oldGroupContainers_.find(group);
+      // Gone from the old layout: another application took it along.
+      if (old == oldGroupContainers_.end() || !exists(old->second)) continue;
+      if (const std::string wrong = compareWithPristine(old->second, ""); !wrong.empty()) {
+        *problems += "group " + group + " of " + identifier + ", whose install failed, stands in part at " +
+                     old->second + ":\n" + wrong;
+      } else {
+        (*left)[group].clear();
+      }
+    }
+  }
+}
+
+void Harness::addItemsLeftInGroups(const std::string& log, LeftBehind* left, std::string* problems) {
+  static constexpr char kFailed[] = "SLAppMigrator: Failed to move item ";
+  for (const std::string& line : lines(log)) {
+    const size_t at = line.find(kFailed);
+    const size_t to = at == std::string::npos ? at : line.find(" to ", at + std::strlen(kFailed));
+    if (to == std::string::npos) continue;
+    const std::string item = plainPath(line.substr(at + std::strlen(kFailed), to - at - std::strlen(kFailed)));
+    for (const auto& [group, old] : oldGroupContainers_) {
+      if (item.rfind(old + "/", 0) != 0 || !exists(item)) continue;
+      const std::string name = item.substr(old.size() + 1);
+      const auto known = left->find(group);
+      if (known != left->end() && known->second.empty()) continue;  // the whole group stays
+      if (const std::string wrong = compareWithPristine(old, name); !wrong.empty()) {
+        *problems += "item " + name + " of group " + group + ", whose move failed, stands changed at " + old +
+                     ":\n" + wrong;
+      } else {
+        (*left)[group].insert(name);
+      }
+    }
+  }
+}
+
 bool Harness::prepare(std::string* failure) {
   std::error_code ec;
   std::filesystem::create_directories(config_.workDirectory, ec);
@@ -243,6 +449,7 @@ bool Harness::prepare(std::string* failure) {
     *failure = "stowline manifest failed: " + manifest.err;
     return false;
   }
+  oldGroupContainers_ = stringObject(slurp(manifest_), "groupContainers");
   const test::ProgramResult copy = test::runProgram({"/bin/cp", "-a", root_, pristine_});
   if (copy.status != 0) {
     *failure = "cp -a failed: " + copy.err;
@@ -331,8 +538,11 @@ Outcome Harness::injectAt(const std::string& errnoName, uint64_t k, bool persist
   if (sanitizerReport) return fail("a sanitizer report");
   if (faulty.status == 0) {
     ++tally->faultyTrue;
-    if (const std::string problems = checkMigrated(); !problems.empty()) {
-      return fail("the faulty run returned true, but:\n" + problems);
+    std::string leftProblems;
+    LeftBehind left;
+    addItemsLeftInGroups(faulty.out, &left, &leftProblems);
+    if (const std::string problems = checkMigrated(left); !problems.empty() || !leftProblems.empty()) {
+      return fail("the faulty run returned true, but:\n" + leftProblems + problems);
     }
   } else if (faulty.status == 1) {
     ++tally->faultyFalse;
@@ -342,9 +552,28 @@ Outcome Harness::injectAt(const std::string& errnoName, uint64_t k, bool persist
   } else {
     return fail("the faulty run crashed or failed to start");
   }
+  const bool returnedFalse = faulty.status == 1;
+  const std::string faultyLog = faulty.out;
   steps.push_back(migrate("clean rerun", ""));
+  if (steps.back().status == 1 && returnedFalse &&
+      rerunFailedOnlyOnPartlyRemovedContainers(faultyLog, steps.back().out)) {
+    ++tally->secondRerun;
+    steps.push_back(migrate("second clean rerun", ""));
+  }
   if (steps.back().status != 0) return fail("the clean rerun did not return true");
-  if (const std::string problems = checkMigrated(); !problems.empty()) return fail(problems);
+  // Groups that a failed bundle install left behind stay where they were,
+  // accepted only after a run that returned false, whole and unchanged; so
+  // do group items whose move failed, unchanged.
+  std::string leftProblems;
+  LeftBehind left;
+  if (returnedFalse) addStrandedGroups(faultyLog, &left, &leftProblems);
+  addItemsLeftInGroups(faultyLog, &left, &leftProblems);
+  if (const std::string problems = checkMigrated(left); !problems.empty() || !leftProblems.empty()) {
+    return fail(leftProblems + problems);
+  }
+  const auto whole = std::count_if(left.begin(), left.end(), [](const auto& group) { return group.second.empty(); });
+  if (whole > 0) ++tally->strandedByDesign;
+  if (static_cast<size_t>(whole) < left.size()) ++tally->groupItemsLeft;
   ++tally->passed;
   return {};
 }

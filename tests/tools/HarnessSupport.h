@@ -13,7 +13,9 @@
 #pragma once
 
 #include <cstdint>
+#include <map>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -41,6 +43,19 @@ struct Tally {
   uint64_t faultyTrue = 0;      // fault runs whose migration still returned true
   uint64_t faultyFalse = 0;     // fault runs that returned false
   uint64_t refused = 0;         // fault runs refused before migrating (exit 2)
+  // Fault runs whose failed bundle install left that application's groups
+  // unmigrated: the design deletes the old container of a failed install
+  // and migrates its groups only after a successful one, so a group that no
+  // other application names stays, whole, at its old path.
+  uint64_t strandedByDesign = 0;
+  // Fault runs that failed part way through removing a migrated container,
+  // after its bundle but not its marker was gone: the design's next run
+  // finds the marker, tries to install the missing bundle and returns false
+  // (and deletes the container); the run after that returns true.
+  uint64_t secondRerun = 0;
+  // Fault runs after which a group's item stays at its old path because its
+  // move failed: the design logs it and goes on, the result unchanged.
+  uint64_t groupItemsLeft = 0;
   std::vector<std::string> failures;
 };
 
@@ -81,9 +96,28 @@ class Harness {
 
   bool freshCopy(std::string* failure);
   Step migrate(const std::string& name, const std::string& fault, const std::string& traceFile = {});
+  // What a faulty run left at its old path by design: group -> the names of
+  // its top-level items that stayed, or no names for the whole group.
+  using LeftBehind = std::map<std::string, std::set<std::string>>;
+
   // verify, PRAGMA integrity_check, the registry's counts against the clean
-  // run's, no install left in flight; empty when all hold.
-  std::string checkMigrated();
+  // run's, no install left in flight; empty when all hold. The items in
+  // `left` may be missing from the new layout and still in the old one
+  // (verify's "missing" and "duplicated" lines), and each whole group in it
+  // makes one group and one group container fewer; nothing else may differ.
+  std::string checkMigrated(const LeftBehind& left = {});
+  // Adds to *left the groups that a faulty run's failed bundle installs
+  // (named in its `log`) left at their old paths, each checked to hold every
+  // item of the pristine layout unchanged; a group that stands there
+  // otherwise is a problem written to *problems.
+  void addStrandedGroups(const std::string& log, LeftBehind* left, std::string* problems);
+  // Adds to *left the group items whose move the `log` reports failed and
+  // that still stand, unchanged, at their old path; one that stands there
+  // changed is a problem.
+  void addItemsLeftInGroups(const std::string& log, LeftBehind* left, std::string* problems);
+  // Every item below `relative` ("" for all) of the old group container
+  // `old` as in the pristine copy; what differs, one line each.
+  std::string compareWithPristine(const std::string& old, const std::string& relative);
   // Containers that a faulty run reported failed must keep their marker.
   std::string checkMarkers(const std::string& log);
   std::string describe(const std::string& headline, const std::vector<Step>& steps) const;
@@ -98,16 +132,19 @@ class Harness {
   // Row counts of the registry after the clean run: applications, groups,
   // safe harbors; and the entries of the three container roots.
   std::vector<int64_t> baseline_;
+  // Each group's old container, from the manifest.
+  std::map<std::string, std::string> oldGroupContainers_;
 };
 
 // The fixture of the harness tests: three applications (the first with a VPN
 // plug-in beside it), two groups of which one is shared, a placeholder, a
 // built-in application with an older copy in the old layout, and the
-// fixture's safe harbors. Seed 2 is one whose applications name both groups,
-// so that every group has somewhere to go.
+// fixture's safe harbors. With seed 3 every group has an application to go
+// with: the first group is named by all three applications, the second by
+// the third alone, so a failed install of that one strands it.
 inline const std::vector<std::string> kSmallFixture = {
     "--apps", "3", "--groups", "2", "--app-vpn", "1", "--placeholders", "1", "--builtin", "1",
-    "--files-per-app", "2", "--bytes-per-file", "32", "--seed", "2"};
+    "--files-per-app", "2", "--bytes-per-file", "32", "--seed", "3"};
 
 // The points a sweep visits: every one when `stride` is 1, otherwise every
 // stride-th one from a start that `seed` varies, plus the first and last.

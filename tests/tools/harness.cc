@@ -17,8 +17,8 @@ namespace {
 constexpr char kUsage[] =
     "usage: crash-harness [--stowline PATH] [--work DIR] [--apps N] [--groups G]\n"
     "                     [--app-vpn V] [--placeholders P] [--builtin B]\n"
-    "                     [--files-per-app F] [--seed S] [--stride K]\n"
-    "                     [--resume-every R] [--errors] [--no-crashes]\n"
+    "                     [--files-per-app F] [--bytes-per-file B] [--seed S]\n"
+    "                     [--stride K] [--resume-every R] [--errors] [--no-crashes]\n"
     "\n"
     "Writes a fixture, counts the mutating operations of its clean migration,\n"
     "then kills the migration at every operation (every Kth with --stride),\n"
@@ -81,7 +81,7 @@ int main(int argc, char** argv) {
     } else if (arg == "--work") {
       options.work = value();
     } else if (arg == "--apps" || arg == "--groups" || arg == "--app-vpn" || arg == "--placeholders" ||
-               arg == "--builtin" || arg == "--files-per-app" || arg == "--seed") {
+               arg == "--builtin" || arg == "--files-per-app" || arg == "--bytes-per-file" || arg == "--seed") {
       setFixture(arg, value());
     } else if (arg == "--stride") {
       options.stride = std::strtoull(value().c_str(), nullptr, 10);
@@ -148,11 +148,16 @@ int main(int argc, char** argv) {
         for (const uint64_t k : sl::harness::samplePoints(points, options.stride, 0)) {
           harness.injectAt(c.name, k, persistent, c.renamesOnly, &tally);
         }
-        std::printf("%s%s%s: %llu run, %llu passed (%llu returned true, %llu false, %llu refused at start)\n", c.name,
-                    persistent ? " from then on" : " once", c.renamesOnly ? " (renames)" : "",
+        std::printf("%s%s%s: %llu run, %llu passed (%llu returned true, %llu false, %llu refused at start; "
+                    "%llu left groups at their old paths after a failed install, %llu left group items after a failed "
+                    "move, %llu needed a second rerun)\n",
+                    c.name, persistent ? " from then on" : " once", c.renamesOnly ? " (renames)" : "",
                     static_cast<unsigned long long>(tally.runs), static_cast<unsigned long long>(tally.passed),
                     static_cast<unsigned long long>(tally.faultyTrue), static_cast<unsigned long long>(tally.faultyFalse),
-                    static_cast<unsigned long long>(tally.refused));
+                    static_cast<unsigned long long>(tally.refused),
+                    static_cast<unsigned long long>(tally.strandedByDesign),
+                    static_cast<unsigned long long>(tally.groupItemsLeft),
+                    static_cast<unsigned long long>(tally.secondRerun));
         std::fflush(stdout);
         printFailures(tally);
         ok = ok && tally.failures.empty();
