@@ -16,6 +16,7 @@
 
 #include "Platform/HostLog.h"
 #include "Platform/InstallerLog.h"
+#include "Platform/Removefile.h"
 
 namespace sl::test {
 
@@ -89,9 +90,9 @@ void forceRemove(const std::string& path) {
         return 0;
       },
       64, FTW_PHYS);
-  nftw(
-      path.c_str(), [](const char* p, const struct stat*, int, FTW*) { return remove(p) == 0 || errno == ENOENT ? 0 : 0; },
-      64, FTW_PHYS | FTW_DEPTH);
+  // The removal works on descriptors, so trees deeper than PATH_MAX (which
+  // nftw cannot walk) go too.
+  (void)sl::removefile(path.c_str(), nullptr, sl::REMOVEFILE_RECURSIVE);
 }
 
 LogCapture::LogCapture() {
