@@ -50,8 +50,17 @@ void appendToBuffer(png_structp png, png_bytep bytes, png_size_t length) {
 
 void flushNothing(png_structp) {}
 
+// Speed over size: with libpng's defaults (every filter tried on every
+// row, deflate level 6) the encoding costs more than rendering the icon.
+// One filter, Up, and level 2 are several times faster, and the file stays
+// within about a third of the default size, for flat icons (scaled-up rows
+// repeat, and Up makes them zeros) and for gradients alike.
+constexpr int kCompressionLevel = 2;
+
 bool writeImage(png_structp png, png_infop info, const sl::Image& image, png_bytepp rows) {
   if (setjmp(png_jmpbuf(png))) return false;
+  png_set_filter(png, PNG_FILTER_TYPE_BASE, PNG_FILTER_UP);
+  png_set_compression_level(png, kCompressionLevel);
   png_set_IHDR(png, info, image.width, image.height, 8, PNG_COLOR_TYPE_RGB_ALPHA, PNG_INTERLACE_NONE,
                PNG_COMPRESSION_TYPE_DEFAULT, PNG_FILTER_TYPE_DEFAULT);
   png_write_info(png, info);

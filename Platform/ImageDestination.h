@@ -7,12 +7,13 @@
 // the one kind of file the system writes with it. The destination keeps a
 // reference to the buffer, which must outlive it.
 //
-// Finalize appends one PNG file (8-bit RGBA, not interlaced) to the buffer
-// and reports success. It fails when no image was added, when the image is
-// not valid (Image::isValid) or larger than libpng writes, when it was
-// called before on the same destination, or when libpng fails; the buffer
-// then holds what it held before the call. A second AddImage on a
-// one-image destination is ignored.
+// Finalize appends one PNG file (8-bit RGBA, not interlaced, encoded for
+// speed rather than the smallest size) to the buffer and reports success.
+// It fails when no image was added, when the image is not valid
+// (Image::isValid) or larger than libpng writes, when it was called before
+// on the same destination, or when libpng fails; the buffer then holds what
+// it held before the call. A second AddImage on a one-image destination is
+// ignored.
 #pragma once
 
 #include <cstddef>
