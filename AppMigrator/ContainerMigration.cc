@@ -20,6 +20,7 @@
 #include "AppMigrator/AppMigrator.h"
 #include "FileManager/SLFileManager.h"
 #include "Platform/ApplicationRegistry.h"
+#include "Platform/AtomicFile.h"
 #include "Platform/PropertyList.h"
 
 namespace {
@@ -58,6 +59,10 @@ bool isMarkerFamilyName(std::string_view name) {
 bool SLAppMigrator::_migrateContainerWithInfo(const sl::Dictionary& info) {
   static constexpr char kFunctionName[] = "-[SLAppMigrator _migrateContainerWithInfo:]";
   SLFileManager& fileManager = SLFileManager::defaultManager();
+  // The placeholder, the moves, the new containers: their flushes wait for
+  // the next step that depends on them (a registry commit, a removal),
+  // which makes them all at once.
+  sl::DeferredSyncs deferred;
 
   const sl::URL container = directoryURLInRecord(info, kContainerPathKey);
   const sl::URL bundle = directoryURLInRecord(info, kBundlePathKey);
@@ -70,7 +75,9 @@ bool SLAppMigrator::_migrateContainerWithInfo(const sl::Dictionary& info) {
   // bundle away, and then it is no placeholder.
   const bool bundleIsPlaceholder = fileManager.bundleAtURLIsPlaceholder(bundle);
 
-  if (!sl::writePropertyListToURL(info, container.URLByAppendingPathComponent(kMigrationMarkerName, false))) {
+  // The marker is on disk before anything leaves the container.
+  if (!sl::writePropertyListToURL(info, container.URLByAppendingPathComponent(kMigrationMarkerName, false)) ||
+      !sl::flushDeferredSyncs()) {
     SLMigratorLog(sl::kLogLevelError, kFunctionName,
                   "SLAppMigrator: Failed to write out container marker dictionary... hopefully we don't need it to "
                   "recover.");

@@ -94,7 +94,65 @@ void removeStaleTemporaries(int dirFd, const std::string& name) {
   }
 }
 
+// Flushes the open `fd` (a file or a directory); EINVAL, a file system that
+// cannot flush it, is no failure.
+bool syncDescriptor(int fd, const std::string& path, Error* error) {
+  if (mut::fsync(fd) != 0) {
+    const int syncErrno = errno;
+    if (syncErrno != EINVAL) return failStep(error, syncErrno, "fsync", path);
+  }
+  return true;
+}
+
+// What this thread has deferred: one open directory on each file system
+// that a deferred flush noted, and how deep the DeferredSyncs objects nest.
+struct Deferred {
+  struct FileSystem {
+    dev_t device;
+    UniqueFd fd;
+    std::string path;
+  };
+  int depth = 0;
+  std::vector<FileSystem> pending;
+};
+thread_local Deferred tDeferred;
+
+// Flushes the directory open as `fd`, or notes its file system while
+// flushes are deferred.
+bool syncOpenDirectory(int fd, const std::string& path, Error* error) {
+  if (tDeferred.depth == 0) return syncDescriptor(fd, path, error);
+  struct stat st;
+  if (::fstat(fd, &st) != 0) return failStep(error, errno, "fstat", path);
+  for (const Deferred::FileSystem& noted : tDeferred.pending) {
+    if (noted.device == st.st_dev) return true;
+  }
+  UniqueFd copy(::fcntl(fd, F_DUPFD_CLOEXEC, 0));
+  if (!copy) return failStep(error, errno, "dup", path);
+  tDeferred.pending.push_back({st.st_dev, std::move(copy), path});
+  return true;
+}
+
 }  // namespace
+
+DeferredSyncs::DeferredSyncs() { ++tDeferred.depth; }
+
+DeferredSyncs::~DeferredSyncs() {
+  if (--tDeferred.depth > 0) return;
+  (void)flushDeferredSyncs();
+  tDeferred.pending.clear();
+}
+
+bool flushDeferredSyncs(Error* error) {
+  std::vector<Deferred::FileSystem>& pending = tDeferred.pending;
+  while (!pending.empty()) {
+    const Deferred::FileSystem& noted = pending.back();
+    if (mut::syncfs(noted.fd.get()) != 0) return failStep(error, errno, "syncfs", noted.path);
+    pending.pop_back();
+  }
+  return true;
+}
+
+bool deferredSyncsPending() { return !tDeferred.pending.empty(); }
 
 bool writeFileAtomically(const URL& url, std::span<const uint8_t> bytes, mode_t mode, Error* error) {
   const std::string& path = url.path();
@@ -135,7 +193,13 @@ bool writeFileAtomically(const URL& url, std::span<const uint8_t> bytes, mode_t 
   }
   // fchmod is not subject to the umask, so the file gets exactly `mode`.
   if (mut::fchmod(fd.get(), mode) != 0) return failStep(error, errno, "fchmod", tempPath);
-  if (mut::fsync(fd.get()) != 0) return failStep(error, errno, "fsync", tempPath);
+  // The content is on disk before the name that replaces the old one. A
+  // new name replaces nothing: while flushes are deferred, the flush that
+  // makes the name durable writes the content too.
+  struct stat existing;
+  const bool newName = tDeferred.depth > 0 && ::fstatat(dir.get(), name.c_str(), &existing, AT_SYMLINK_NOFOLLOW) != 0 &&
+                       errno == ENOENT;
+  if (!newName && mut::fsync(fd.get()) != 0) return failStep(error, errno, "fsync", tempPath);
   if (::close(fd.release()) != 0) return failStep(error, errno, "close", tempPath);
 
   // rename replaces a symbolic link at the destination with the file; it
@@ -149,22 +213,12 @@ bool writeFileAtomically(const URL& url, std::span<const uint8_t> bytes, mode_t 
 
   // Makes the rename durable. Some file systems cannot flush a directory
   // (EINVAL): the rename then stands as the file system keeps it.
-  if (mut::fsync(dir.get()) != 0 && errno != EINVAL) return failStep(error, errno, "fsync", dirPath);
+  if (!syncOpenDirectory(dir.get(), dirPath, error)) return false;
   removeStaleTemporaries(dir.get(), name);
   return true;
 }
 
 namespace {
-
-// Flushes the open `fd` (a file or a directory); EINVAL, a file system that
-// cannot flush it, is no failure.
-bool syncDescriptor(int fd, const std::string& path, Error* error) {
-  if (mut::fsync(fd) != 0) {
-    const int syncErrno = errno;
-    if (syncErrno != EINVAL) return failStep(error, syncErrno, "fsync", path);
-  }
-  return true;
-}
 
 // Flushes what `fd` (open on `path`) holds, then `fd` itself.
 bool syncTreeAt(int fd, const std::string& path, int depth, Error* error) {
@@ -201,7 +255,7 @@ bool syncTreeAt(int fd, const std::string& path, int depth, Error* error) {
 bool syncDirectory(const std::string& path, Error* error) {
   UniqueFd fd(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!fd) return failStep(error, errno, "open", path);
-  return syncDescriptor(fd.get(), path, error);
+  return syncOpenDirectory(fd.get(), path, error);
 }
 
 bool syncParentDirectory(const std::string& path, Error* error) {

@@ -8,7 +8,9 @@
 // never missing when it existed before. A failure to flush the directory
 // after the rename is reported too (the new content is then in place, its
 // durability unknown); a file system that cannot flush directories (EINVAL)
-// is not a failure.
+// is not a failure. Inside a DeferredSyncs scope (below) the directory's
+// flush waits for the scope's, and so does the file's own when it makes a
+// new name.
 //
 // The temporary file is ".<name>.XXXXXX" (six random characters) and is
 // made with O_EXCL and O_NOFOLLOW relative to the open directory. The new
@@ -50,5 +52,37 @@ bool writeFileAtomically(const URL& url, std::span<const uint8_t> bytes, mode_t 
 bool syncDirectory(const std::string& path, Error* error = nullptr);
 bool syncParentDirectory(const std::string& path, Error* error = nullptr);
 bool syncTree(const std::string& path, Error* error = nullptr);
+
+// Deferred flushing, for a run of changes that all become durable at one
+// later point (the commit that records them, the removal of what they
+// emptied). While a DeferredSyncs object is alive on a thread, the calls
+// above that flush a directory (syncDirectory, syncParentDirectory, the
+// directory step of writeFileAtomically) only note the directory's file
+// system, and writeFileAtomically skips the file's own fsync when it makes
+// a new name (no older content can be lost). flushDeferredSyncs then makes
+// all of it durable with one syncfs per noted file system, which writes
+// back every change made there so far: data, names and attributes.
+//
+// What depends on a deferred change flushes first: removefile before it
+// removes anything but an empty directory, the registry before it commits.
+// A failed flush keeps its file systems noted, so whatever depends on it
+// fails too, and reports "syncfs of <path> failed: <strerror>" (the first
+// directory noted on that file system). syncTree is never deferred.
+//
+// Objects nest; the outermost one flushes what is still pending when it
+// ends, ignoring failure, so an owner on its way to success calls
+// flushDeferredSyncs itself.
+class DeferredSyncs {
+ public:
+  DeferredSyncs();
+  ~DeferredSyncs();
+  DeferredSyncs(const DeferredSyncs&) = delete;
+  DeferredSyncs& operator=(const DeferredSyncs&) = delete;
+};
+
+// Flushes what this thread has deferred; true when nothing was.
+bool flushDeferredSyncs(Error* error = nullptr);
+// True when this thread has deferred a flush that has not been made yet.
+bool deferredSyncsPending();
 
 }  // namespace sl

@@ -173,6 +173,8 @@ bool setPlanForTesting(std::string_view spec) {
 
 uint64_t admittedCount() { return state().admitted.load(); }
 
+uint64_t matchedCount() { return state().matched.load(); }
+
 #endif  // STOWLINE_FAULT_INJECTION
 
 }  // namespace sl::mut

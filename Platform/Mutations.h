@@ -43,7 +43,7 @@ enum class Kind : uint8_t {
   kCreate,         // a new file, or an existing one truncated on open
   kWrite,          // bytes into a file
   kTruncate,       // a file's length
-  kSync,           // fsync, fdatasync
+  kSync,           // fsync, fdatasync, syncfs
   kRename,         // rename, renameat, renameat2
   kRemove,         // unlink, rmdir
   kMakeDirectory,  // mkdir, mkdtemp
@@ -68,12 +68,15 @@ int admit(Kind kind, const char* what) noexcept;
 // spec does not parse. For tests that drive the seam in-process.
 bool setPlanForTesting(std::string_view spec);
 
-// Operations admitted since the start (or the last setPlanForTesting).
+// Operations admitted since the start (or the last setPlanForTesting), and
+// those of them of the plan's kinds (all kinds when it names none).
 uint64_t admittedCount();
+uint64_t matchedCount();
 #else
 inline int admit(Kind, const char*) noexcept { return 0; }
 inline bool setPlanForTesting(std::string_view) { return false; }
 inline uint64_t admittedCount() { return 0; }
+inline uint64_t matchedCount() { return 0; }
 #endif
 
 // True when this build honours fault plans.
@@ -190,6 +193,10 @@ inline int fsync(int fd) {
 inline int fdatasync(int fd) {
   SL_MUT_ADMIT(Kind::kSync, nullptr, -1);
   return ::fdatasync(fd);
+}
+inline int syncfs(int fd) {
+  SL_MUT_ADMIT(Kind::kSync, nullptr, -1);
+  return ::syncfs(fd);
 }
 
 // ---- Metadata -----------------------------------------------------------

@@ -92,11 +92,13 @@
 #include <mutex>
 #include <new>
 #include <string>
+#include <string_view>
 #include <system_error>
 #include <thread>
 #include <utility>
 #include <vector>
 
+#include "Platform/AtomicFile.h"
 #include "Platform/DirectoryEntries.h"
 #include "Platform/Mutations.h"
 #include "Platform/UniqueFd.h"
@@ -612,6 +614,20 @@ int resolveTop(const char* path, std::string& topPath, UniqueFd& parentFd, std::
   return 0;
 }
 
+// True for a directory with no entries: removing it loses nothing.
+bool isEmptyDirectory(int parentFd, const std::string& name, Kind kind) {
+  if (kind != Kind::kDirectory) return false;
+  UniqueFd fd(openat(parentFd, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  if (!fd) return false;
+  UniqueDir dir = fdopendir(fd);
+  if (!dir) return false;
+  while (const struct dirent* entry = readdir(dir.get())) {
+    const std::string_view entryName = entry->d_name;
+    if (entryName != "." && entryName != "..") return false;
+  }
+  return true;
+}
+
 }  // namespace
 
 removefile_state_t removefile_state_alloc() {
@@ -676,6 +692,15 @@ int removefile(const char* path, removefile_state_t state, removefile_flags_t fl
   if (int err = resolveTop(path, topPath, parentFd, name, kind); err != 0) {
     errno = err;
     return -1;
+  }
+  // What this thread deferred (renames out of this very tree, say) reaches
+  // the disk before anything here goes.
+  if (deferredSyncsPending() && !isEmptyDirectory(parentFd.get(), name, kind)) {
+    Error flushError;
+    if (!flushDeferredSyncs(&flushError)) {
+      errno = static_cast<int>(flushError.code());
+      return -1;
+    }
   }
   int result;
   int err;

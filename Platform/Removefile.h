@@ -21,6 +21,10 @@
 //    callback the first error ends the walk the same way.
 //  - A path where nothing stands fails with -1 and ENOENT, without a
 //    callback. Otherwise the result is 0 when the walk reached its end.
+//  - Flushes this thread has deferred (DeferredSyncs, AtomicFile.h) are made
+//    before anything but an empty directory is removed; when that fails,
+//    nothing is removed and the call fails with -1 and the flush's errno,
+//    without a callback.
 #pragma once
 
 #include <cstdint>

@@ -1,5 +1,6 @@
 #include "Registry/Database.h"
 
+#include "Platform/AtomicFile.h"
 #include "Platform/Format.h"
 #include "Registry/CountedVfs.h"
 #include "Registry/EmbeddedRegistry.h"
@@ -11,7 +12,28 @@ namespace {
 
 constexpr char kFunctionName[] = "rg::Database";
 
+// Why this thread's last commit was turned down by flushBeforeCommit.
+thread_local sl::Error tCommitFlushError;
+// Set while a transaction that depends on nothing before it commits.
+thread_local bool tCommitIndependent = false;
+
+// Nothing is committed while a flush that this thread deferred is pending:
+// what a transaction records (a container made, an item moved) may be among
+// it. A failed flush turns the commit into a rollback.
+int flushBeforeCommit(void*) {
+  if (tCommitIndependent) return 0;
+  sl::Error flushError;
+  if (sl::flushDeferredSyncs(&flushError)) return 0;
+  tCommitFlushError = flushError;
+  return 1;
+}
+
 sl::Error sqliteError(sqlite3* db, int code, std::string_view what) {
+  if (code == SQLITE_CONSTRAINT_COMMITHOOK && !tCommitFlushError.isNull()) {
+    return _CreateError(kFunctionName, __LINE__, RGErrorDomain, kRGDatabaseError,
+                        "%s failed: what it records is not on disk: %@", std::string(what),
+                        tCommitFlushError.localizedDescription());
+  }
   const char* message = db != nullptr ? sqlite3_errmsg(db) : sqlite3_errstr(code);
   return _CreateError(kFunctionName, __LINE__, RGErrorDomain, kRGDatabaseError, "%s failed: %s (%d)",
                       std::string(what), message, code);
@@ -29,6 +51,7 @@ std::optional<Database> Database::open(const std::string& path, sl::Error* error
     return std::nullopt;
   }
   sqlite3_extended_result_codes(db.get(), 1);
+  sqlite3_commit_hook(db.get(), flushBeforeCommit, nullptr);
   Database database(std::move(db));
   if (!database.exec("PRAGMA journal_mode=WAL; PRAGMA synchronous=FULL; PRAGMA foreign_keys=ON;"
                      "PRAGMA busy_timeout=5000;",
@@ -45,15 +68,38 @@ bool Database::exec(std::string_view sql, sl::Error* error) {
   return true;
 }
 
+void StatementRelease::operator()(sqlite3_stmt* statement) const {
+  if (inUse == nullptr) {
+    sqlite3_finalize(statement);
+    return;
+  }
+  // The reset answers the last step's error again; that step reported it.
+  sqlite3_reset(statement);
+  sqlite3_clear_bindings(statement);
+  *inUse = false;
+}
+
 std::optional<Statement> Database::prepare(std::string_view sql, sl::Error* error) {
+  const auto found = kept_.find(sql);
+  if (found != kept_.end() && !found->second.inUse) {
+    found->second.inUse = true;
+    return Statement(*this, BorrowedStatement(found->second.statement.get(), StatementRelease{&found->second.inUse}));
+  }
+
+  // A text seen for the first time is kept; a nested use of a text whose
+  // statement is lent gets its own.
+  const bool keep = found == kept_.end() && kept_.size() < kMaxKeptStatements;
   sqlite3_stmt* raw = nullptr;
-  const int rc = sqlite3_prepare_v2(db_.get(), sql.data(), static_cast<int>(sql.size()), &raw, nullptr);
+  const int rc = sqlite3_prepare_v3(db_.get(), sql.data(), static_cast<int>(sql.size()),
+                                    keep ? SQLITE_PREPARE_PERSISTENT : 0, &raw, nullptr);
   UniqueStatement statement(raw);
   if (rc != SQLITE_OK) {
     sl::fail(error, sqliteError(db_.get(), rc, std::string(sql)));
     return std::nullopt;
   }
-  return Statement(*this, std::move(statement));
+  if (!keep || statement == nullptr) return Statement(*this, BorrowedStatement(statement.release()));
+  KeptStatement& kept = kept_.emplace(std::string(sql), KeptStatement{std::move(statement), true}).first->second;
+  return Statement(*this, BorrowedStatement(kept.statement.get(), StatementRelease{&kept.inUse}));
 }
 
 sl::Error Database::lastError(std::string_view what) const {
@@ -99,7 +145,9 @@ std::optional<std::string> Statement::text(int column) const {
                      static_cast<size_t>(sqlite3_column_bytes(statement_.get(), column)));
 }
 
-Transaction::Transaction(Database& db, sl::Error* error) : db_(db) { began_ = db_.exec("BEGIN IMMEDIATE", error); }
+Transaction::Transaction(Database& db, sl::Error* error, Depends depends) : db_(db), depends_(depends) {
+  began_ = db_.exec("BEGIN IMMEDIATE", error);
+}
 
 Transaction::~Transaction() {
   if (began_ && !committed_) sqlite3_exec(db_.handle(), "ROLLBACK", nullptr, nullptr, nullptr);
@@ -107,7 +155,10 @@ Transaction::~Transaction() {
 
 bool Transaction::commit(sl::Error* error) {
   if (!began_) return false;
-  if (!db_.exec("COMMIT", error)) return false;
+  tCommitIndependent = depends_ == Depends::kOnNothingBefore;
+  const bool done = db_.exec("COMMIT", error);
+  tCommitIndependent = false;
+  if (!done) return false;
   committed_ = true;
   return true;
 }

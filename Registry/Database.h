@@ -1,19 +1,30 @@
 // Thin RAII layer over SQLite for the embedded registry.
 //
-// A Database owns one connection (closed with sqlite3_close_v2), a Statement
-// one prepared statement (finalized on destruction), a Transaction one
-// BEGIN IMMEDIATE ... COMMIT that rolls back unless commit() succeeded.
+// A Database owns one connection (closed with sqlite3_close_v2) and keeps
+// the statements it prepares, one per SQL text, for reuse. A Statement
+// borrows one of them: when it goes out of scope the statement is reset and
+// its bindings cleared, ready for the next prepare of the same text. A
+// prepare of a text whose statement is still borrowed (a nested use) gets a
+// statement of its own, finalized on destruction. A Statement must not
+// outlive its Database. A Transaction is one BEGIN IMMEDIATE ... COMMIT
+// that rolls back unless commit() succeeded.
+// Every commit first makes the flushes this thread deferred
+// (sl::DeferredSyncs): what it records may depend on them. A transaction
+// that records only what is to come (an intent) says so and skips that.
 // Failures become records in RGErrorDomain, code kRGDatabaseError, with
 // SQLite's message and result code in the text.
 #pragma once
 
 #include <sqlite3.h>
 
+#include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 
 #include "Platform/Error.h"
 
@@ -28,6 +39,15 @@ struct SqliteFinalize {
 using UniqueSqlite = std::unique_ptr<sqlite3, SqliteClose>;
 using UniqueStatement = std::unique_ptr<sqlite3_stmt, SqliteFinalize>;
 
+// Gives back a statement that a Statement held: one of the Database's kept
+// statements (inUse set) is reset, cleared and marked free; any other is
+// finalized.
+struct StatementRelease {
+  bool* inUse = nullptr;
+  void operator()(sqlite3_stmt* statement) const;
+};
+using BorrowedStatement = std::unique_ptr<sqlite3_stmt, StatementRelease>;
+
 class Statement;
 
 class Database {
@@ -38,6 +58,8 @@ class Database {
 
   // Runs one or more statements without results.
   bool exec(std::string_view sql, sl::Error* error);
+  // The statement for sql, reused from an earlier prepare of the same text
+  // when there is one and it is not in use.
   std::optional<Statement> prepare(std::string_view sql, sl::Error* error);
   // A record for the connection's last failure, `what` naming the step.
   sl::Error lastError(std::string_view what) const;
@@ -46,13 +68,27 @@ class Database {
 
  private:
   explicit Database(UniqueSqlite db) : db_(std::move(db)) {}
+
+  struct KeptStatement {
+    UniqueStatement statement;
+    bool inUse = false;  // lent to a live Statement
+  };
+  struct SqlHash {
+    using is_transparent = void;
+    size_t operator()(std::string_view sql) const { return std::hash<std::string_view>{}(sql); }
+  };
+  // Texts beyond this many are prepared afresh on every use.
+  static constexpr size_t kMaxKeptStatements = 64;
+
   UniqueSqlite db_;
+  // After db_: the kept statements are finalized before the connection
+  // closes. A Statement points into a node of the map, which stays where it
+  // is when the map grows or moves with the Database.
+  std::unordered_map<std::string, KeptStatement, SqlHash, std::equal_to<>> kept_;
 };
 
 class Statement {
  public:
-  Statement(Database& db, UniqueStatement statement) : db_(&db), statement_(std::move(statement)) {}
-
   // Binds are 1-based, as in SQLite; an empty optional binds NULL.
   Statement& bind(int index, std::string_view text);
   Statement& bind(int index, const std::string& text) { return bind(index, std::string_view(text)); }
@@ -71,8 +107,11 @@ class Statement {
   int64_t integer(int column) const { return sqlite3_column_int64(statement_.get(), column); }
 
  private:
+  friend class Database;
+  Statement(Database& db, BorrowedStatement statement) : db_(&db), statement_(std::move(statement)) {}
+
   Database* db_;
-  UniqueStatement statement_;
+  BorrowedStatement statement_;
   bool failed_ = false;
 };
 
@@ -81,7 +120,8 @@ class Statement {
 // the error slot given to the constructor).
 class Transaction {
  public:
-  Transaction(Database& db, sl::Error* error);
+  enum class Depends { kOnDeferredChanges, kOnNothingBefore };
+  Transaction(Database& db, sl::Error* error, Depends depends = Depends::kOnDeferredChanges);
   ~Transaction();
   Transaction(const Transaction&) = delete;
   Transaction& operator=(const Transaction&) = delete;
@@ -91,6 +131,7 @@ class Transaction {
 
  private:
   Database& db_;
+  Depends depends_;
   bool began_ = false;
   bool committed_ = false;
 };

@@ -18,9 +18,16 @@
 // operation not marked done is undone (bundles moved back into the package,
 // the containers it made removed: they hold no user data yet, since data is
 // moved in only after the install returned), one marked done is finished
-// (its cleanup repeated). Every recovery step can be repeated. The guarantee
-// covers a killed process; it does not promise durability of directory
-// entries across a power loss (no directory is fsync'ed).
+// (its cleanup repeated). Every recovery step can be repeated.
+//
+// Durability. The database commits with synchronous=FULL in WAL mode, and
+// no commit reaches the disk before the file-system changes it may depend
+// on: an install defers the flushes of its moves and new containers
+// (sl::DeferredSyncs), and the database's commit hook makes them, one
+// syncfs per file system, before the commit is written; a failed flush
+// rolls the commit back. Only the deletion of a finished operation commits
+// without a flush of its own: lost to a power cut, it costs a repeat of the
+// cleanup at the next open.
 //
 // A cross-volume move copies the bundle into a temporary name inside the
 // new bundle container, renames it into place, then renames the source to a

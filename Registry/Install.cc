@@ -35,6 +35,10 @@ struct PlannedGroup {
 bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Dictionary& withOptions, sl::Error* error,
                                           const RGProgressHandler& usingBlock) {
   std::lock_guard lock(mutex_);
+  // The directories that the moves and new containers change are flushed
+  // together, by the commit that records them (or by the removal that
+  // consumes a refused package), not one by one.
+  sl::DeferredSyncs deferred;
   SLFileManager& fm = SLFileManager::defaultManager();
   const std::string packagePath = path.path();
 
@@ -253,7 +257,9 @@ bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Diction
   report(10, "Preparing");
   int64_t operation = 0;
   {
-    rg::Transaction transaction(db_, &dbError);
+    // The intent names only what is still to come: the flushes of what came
+    // before (the package's own making) wait for the commit of the state.
+    rg::Transaction transaction(db_, &dbError, rg::Transaction::Depends::kOnNothingBefore);
     if (!transaction.began()) return refuse(kRGProgressErrorInstallFailed, dbError);
     std::optional<rg::Statement> insert = db_.prepare(
         "INSERT INTO operations(identifier, package_path, new_bundle_container, old_bundle_container) "
@@ -339,9 +345,9 @@ bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Diction
   }
 
   // Everything the new state records is on disk before it is committed:
-  // the containers made above, their entries, and the installed bundle's
-  // attributes (the moves flushed their own directories). After the
-  // commit the package may go.
+  // the containers made above, their entries, the moves and the installed
+  // bundle's attributes. The flushes noted here and by the moves are made
+  // by the commit. After the commit the package may go.
   {
     std::vector<std::string> durable = {bundleRoot_, bundleContainer, installedBundle};
     if (newDataContainer) {

@@ -49,6 +49,21 @@ bool deleteOperation(rg::Database& db, int64_t operation, sl::Error* error) {
   return statement && statement->bind(1, operation).run(error);
 }
 
+// The deletion that ends a finished operation. Lost to a crash, it costs only
+// a repeat of the cleanup at the next open (every step of it can be
+// repeated), so its commit is not flushed: the next durable commit carries
+// it to the disk.
+bool deleteFinishedOperation(rg::Database& db, int64_t operation, sl::Error* error) {
+  if (!db.exec("PRAGMA synchronous=NORMAL", error)) return false;
+  const bool deleted = deleteOperation(db, operation, error);
+  sl::Error restoreError;
+  if (!db.exec("PRAGMA synchronous=FULL", &restoreError)) {
+    // Every later commit would go undurable: that is this call's failure.
+    return deleted ? sl::fail(error, restoreError) : false;
+  }
+  return deleted;
+}
+
 // Paths recorded by the registry itself are never empty and always below a
 // containers root; this refuses anything else before a tree is removed.
 bool removeRecorded(const std::string& path, sl::Error* error) {
@@ -105,5 +120,5 @@ bool EmbeddedRegistry::finishOperation(int64_t operation, sl::Error* error) {
   for (const rg::Move& move : row->moves) {
     if (!removeRecorded(rg::trashPathFor(move.source), error)) return false;
   }
-  return deleteOperation(db_, operation, error);
+  return deleteFinishedOperation(db_, operation, error);
 }

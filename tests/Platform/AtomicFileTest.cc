@@ -8,6 +8,8 @@
 #include <filesystem>
 #include <set>
 
+#include "Platform/Mutations.h"
+#include "Platform/Removefile.h"
 #include "TestSupport/TestSupport.h"
 
 namespace sl {
@@ -97,6 +99,68 @@ TEST(AtomicFileTest, FailureLeavesTheOldFileIntact) {
   EXPECT_FALSE(writeFileAtomically(fileURL(dir / "missing/file"), bytesOf("x"), 0644, &error));
   test::expectPOSIXRecord(error, ENOENT, "open of " + (dir / "missing") + " failed: No such file or directory",
                           nullptr);
+}
+
+
+// Counts flushes (and fails the Nth with EIO) through the mutation layer's
+// plan, which counts only the kinds it names.
+TEST(AtomicFileTest, DeferredFlushesWaitForWhatDependsOnThem) {
+  if (!mut::kFaultInjectionBuilt) GTEST_SKIP() << "a build without fault plans";
+  TempDir disk, shm(TempDir::kShm);
+  test::writeFile(disk / "old", "old");
+  test::writeFile(disk / "doomed", "x");
+  ASSERT_EQ(mkdir((disk / "empty").c_str(), 0755), 0);
+  auto syncs = [](const char* plan = "EIO@1000:sync") { ASSERT_TRUE(mut::setPlanForTesting(plan)); };
+  Error error;
+
+  syncs();
+  ASSERT_TRUE(syncDirectory(disk.path()));
+  EXPECT_EQ(mut::matchedCount(), 1u) << "flushed at once outside a scope";
+  {
+    DeferredSyncs outer;
+    syncs();
+    {
+      DeferredSyncs inner;
+      ASSERT_TRUE(syncDirectory(disk.path()) && syncParentDirectory(disk / "old") && syncDirectory(shm.path()));
+      // A new name needs no flush of its own; a replaced one keeps its
+      // content's flush before the rename.
+      ASSERT_TRUE(writeFileAtomically(fileURL(disk / "new"), bytesOf("new"), 0644, &error)) << error.description();
+      EXPECT_EQ(mut::matchedCount(), 0u);
+      ASSERT_TRUE(writeFileAtomically(fileURL(disk / "old"), bytesOf("newer"), 0644, &error)) << error.description();
+      EXPECT_EQ(mut::matchedCount(), 1u);
+      EXPECT_EQ(syncDirectory(disk / "missing", &error), false);
+      EXPECT_EQ(error.localizedDescription().str(), "open of " + (disk / "missing") + " failed: No such file or directory");
+    }
+    EXPECT_TRUE(deferredSyncsPending()) << "the inner scope leaves the flush to the outer one";
+
+    // An empty directory goes without a flush; anything else waits for one
+    // per file system, and stays when that fails.
+    syncs("EIO@1:sync");
+    ASSERT_EQ(removefile((disk / "empty").c_str(), nullptr, 0), 0);
+    EXPECT_EQ(mut::matchedCount(), 0u);
+    errno = 0;
+    EXPECT_EQ(removefile((disk / "doomed").c_str(), nullptr, 0), -1);
+    EXPECT_EQ(errno, EIO);
+    EXPECT_EQ(readFile(disk / "doomed"), "x");
+    EXPECT_TRUE(deferredSyncsPending());
+    syncs("EIO@1:sync");
+    EXPECT_FALSE(flushDeferredSyncs(&error));
+    EXPECT_TRUE(error.isPOSIX(EIO));
+    EXPECT_THAT(error.localizedDescription().str(), AllOf(StartsWith("syncfs of "), EndsWith(" failed: Input/output error")));
+    syncs();
+    ASSERT_EQ(removefile((disk / "doomed").c_str(), nullptr, 0), 0);
+    EXPECT_EQ(mut::matchedCount(), 2u) << "one syncfs for each file system";
+    EXPECT_FALSE(deferredSyncsPending());
+    EXPECT_TRUE(flushDeferredSyncs(&error));
+    EXPECT_EQ(mut::matchedCount(), 2u);
+
+    ASSERT_TRUE(syncDirectory(shm.path()));
+  }
+  EXPECT_EQ(mut::matchedCount(), 3u) << "the outermost scope flushes what is left";
+  EXPECT_FALSE(deferredSyncsPending());
+  EXPECT_EQ(readFile(disk / "new"), "new");
+  EXPECT_EQ(readFile(disk / "old"), "newer");
+  mut::setPlanForTesting("");
 }
 
 }  // namespace

@@ -17,7 +17,7 @@ set -u
 root=${1:?usage: MutationsLint.sh <source root>}
 cd "$root" || exit 2
 
-names='rename|renameat|renameat2|unlink|unlinkat|rmdir|mkdir|mkdirat|mkdtemp|mkstemp|mkostemp|creat|write|pwrite|writev|pwritev|ftruncate|truncate|fsync|fdatasync|sync_file_range|fchmod|fchmodat|chmod|lchmod|fchown|fchownat|chown|lchown|utimensat|futimens|utimes|utime|setxattr|lsetxattr|fsetxattr|removexattr|lremovexattr|fremovexattr|symlink|symlinkat|link|linkat|copy_file_range|sendfile|fallocate|posix_fallocate|syscall|open|openat'
+names='rename|renameat|renameat2|unlink|unlinkat|rmdir|mkdir|mkdirat|mkdtemp|mkstemp|mkostemp|creat|write|pwrite|writev|pwritev|ftruncate|truncate|fsync|fdatasync|syncfs|sync_file_range|fchmod|fchmodat|chmod|lchmod|fchown|fchownat|chown|lchown|utimensat|futimens|utimes|utime|setxattr|lsetxattr|fsetxattr|removexattr|lremovexattr|fremovexattr|symlink|symlinkat|link|linkat|copy_file_range|sendfile|fallocate|posix_fallocate|syscall|open|openat'
 call="(^|[^A-Za-z0-9_.>:])(::)?($names)[[:space:]]*\\(([^)]|\$)"
 declaration="(^|[^A-Za-z0-9_])(int|bool|void|ssize_t|long|[A-Za-z0-9_]*>)[[:space:]]+\\*?($names)[[:space:]]*\\("
 readOnlyOpen="(^|[^A-Za-z0-9_.>:])(::)?(open|openat)[[:space:]]*\\(.*(O_RDONLY|O_PATH)"

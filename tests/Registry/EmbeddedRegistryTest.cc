@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 
 #include "FileManager/SLFileManager.h"
+#include "Registry/Database.h"
 #include "Registry/RegistryTestSupport.h"
 
 namespace {
@@ -244,6 +245,45 @@ TEST(EmbeddedRegistryTest, SafeHarborsAndDataProtection) {
   ASSERT_TRUE(SLFileManager::defaultManager().dataProtectionClassOfItemAtURL(data, &protectionClass));
   EXPECT_EQ(protectionClass, 4);
   SLInstallerLibrary::setDefaultLibrary(nullptr);
+}
+
+// Statements are kept per SQL text and lent out: every use starts afresh,
+// a nested use of a text gets a statement of its own, and a failure reads
+// as it did when each use prepared its own.
+TEST(DatabaseTest, KeptStatements) {
+  TempDir dir(TempDir::kShm);
+  std::optional<rg::Database> opened = rg::Database::open(dir / "db.sqlite", nullptr);
+  ASSERT_TRUE(opened && opened->exec("CREATE TABLE t(x TEXT UNIQUE, y TEXT)", nullptr));
+  constexpr char kInsert[] = "INSERT INTO t VALUES(?, ?)";
+  constexpr char kSelect[] = "SELECT x, y FROM t ORDER BY x";
+  ASSERT_TRUE(opened->prepare(kInsert, nullptr)->bind(1, "a").bind(2, "1").run(nullptr));
+  rg::Database db = std::move(*opened);  // the kept statement moves along
+  ASSERT_TRUE(db.prepare(kInsert, nullptr)->bind(1, "b").run(nullptr));  // y not bound: NULL
+
+  for (int use = 0; use < 2; ++use) {  // the first row only: the next use starts over
+    std::optional<rg::Statement> select = db.prepare(kSelect, nullptr);
+    ASSERT_TRUE(select && select->step(nullptr));
+    EXPECT_EQ(select->text(0), "a");
+  }
+  std::vector<std::string> pairs;
+  std::optional<rg::Statement> outer = db.prepare(kSelect, nullptr);
+  while (outer->step(nullptr) && pairs.size() < 8) {  // bounded: a shared statement would loop
+    std::optional<rg::Statement> inner = db.prepare(kSelect, nullptr);
+    while (inner->step(nullptr)) pairs.push_back(*outer->text(0) + *inner->text(0) + inner->text(1).value_or("-"));
+  }
+  outer.reset();
+  EXPECT_EQ(pairs, (std::vector<std::string>{"aa1", "ab-", "ba1", "bb-"}));
+
+  sl::Error error;
+  EXPECT_FALSE(db.prepare(kInsert, nullptr)->bind(1, "a").run(&error));
+  sl::test::expectRecord(error, RGErrorDomain, kRGDatabaseError,
+                         "INSERT INTO t VALUES(?, ?) failed: UNIQUE constraint failed: t.x (2067)", "rg::Database");
+  EXPECT_TRUE(db.prepare(kInsert, nullptr)->bind(1, "c").run(nullptr));
+
+  int open = 0;
+  for (sqlite3_stmt* s = sqlite3_next_stmt(db.handle(), nullptr); s != nullptr; s = sqlite3_next_stmt(db.handle(), s))
+    ++open;
+  EXPECT_EQ(open, 2) << "one statement per text; the nested one is finalized";
 }
 
 }  // namespace

@@ -14,6 +14,7 @@
 #include <optional>
 #include <set>
 
+#include "Platform/AtomicFile.h"
 #include "Platform/Bundle.h"
 #include "Platform/Mutations.h"
 #include "Registry/Database.h"
@@ -210,4 +211,34 @@ TEST(RegistryCrashTest, RefusedDatabaseChangesFailAndLeaveNothing) {
     ASSERT_TRUE(sl::mut::setPlanForTesting(""));
     EXPECT_EQ(column(*db, "SELECT COUNT(*) FROM t"), std::set<std::string>{"0"});
   }
+}
+
+// A commit waits for the flushes this thread deferred; when they fail it is
+// rolled back and says why.
+TEST(RegistryCrashTest, CommitsFlushWhatWasDeferredFirst) {
+  if (!sl::mut::kFaultInjectionBuilt) GTEST_SKIP() << "a build without fault plans";
+  sl::test::TempDir dir(sl::test::TempDir::kShm);
+  std::optional<rg::Database> db = rg::Database::open(dir / "db.sqlite", nullptr);
+  ASSERT_TRUE(db && db->exec("CREATE TABLE t(x)", nullptr));
+  sl::DeferredSyncs deferred;
+  ASSERT_TRUE(sl::syncDirectory(dir.path()));
+  ASSERT_TRUE(sl::mut::setPlanForTesting("EIO@1:sync"));
+  sl::Error error;
+  EXPECT_FALSE(db->exec("INSERT INTO t VALUES(1)", &error));
+  sl::test::expectRecord(error, RGErrorDomain, kRGDatabaseError,
+                         "INSERT INTO t VALUES(1) failed: what it records is not on disk: syncfs of " + dir.path() +
+                             " failed: Input/output error",
+                         "rg::Database");
+  ASSERT_TRUE(sl::mut::setPlanForTesting("EIO@1000:sync"));
+  EXPECT_EQ(column(*db, "SELECT COUNT(*) FROM t"), std::set<std::string>{"0"});
+  {
+    rg::Transaction intent(*db, nullptr, rg::Transaction::Depends::kOnNothingBefore);
+    ASSERT_TRUE(db->exec("INSERT INTO t VALUES(1)", nullptr) && intent.commit(nullptr));
+  }
+  EXPECT_TRUE(sl::deferredSyncsPending());
+  EXPECT_EQ(sl::mut::matchedCount(), 1u) << "an intent waits for nothing: the log's flush only";
+  ASSERT_TRUE(db->exec("INSERT INTO t VALUES(2)", nullptr));
+  EXPECT_FALSE(sl::deferredSyncsPending());
+  EXPECT_EQ(sl::mut::matchedCount(), 3u) << "the deferred flush, then the log's own";
+  ASSERT_TRUE(sl::mut::setPlanForTesting(""));
 }
