@@ -213,7 +213,9 @@ class Terminal {
   }
   void clearBarLocked() {
     if (barWidth_ == 0) return;
-    writeAll(STDERR_FILENO, "\r" + std::string(barWidth_, ' ') + "\r");
+    std::string blank(barWidth_ + 2, ' ');
+    blank.front() = blank.back() = '\r';
+    writeAll(STDERR_FILENO, blank);
     barWidth_ = 0;
   }
 
@@ -326,8 +328,10 @@ class ProgressBar {
     const double fraction = std::clamp(static_cast<double>(progress), 0.0, 1.0);
     const int filled = static_cast<int>(fraction * kWidth);
     const auto done = static_cast<uint64_t>(std::llround(fraction * static_cast<double>(items_)));
-    std::string line = "[" + std::string(static_cast<size_t>(filled), '#') +
-                       std::string(static_cast<size_t>(kWidth - filled), '-') + "] ";
+    std::string line = "[";
+    line.append(static_cast<size_t>(filled), '#');
+    line.append(static_cast<size_t>(kWidth - filled), '-');
+    line += "] ";
     char figures[64];
     std::snprintf(figures, sizeof figures, "%3d%%  %llu/%llu items", static_cast<int>(fraction * 100.0),
                   static_cast<unsigned long long>(done), static_cast<unsigned long long>(items_));
