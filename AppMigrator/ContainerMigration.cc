@@ -75,12 +75,13 @@ bool SLAppMigrator::_migrateContainerWithInfo(const sl::Dictionary& info) {
   // bundle away, and then it is no placeholder.
   const bool bundleIsPlaceholder = fileManager.bundleAtURLIsPlaceholder(bundle);
 
-  // The marker is on disk before anything leaves the container.
-  if (!sl::writePropertyListToURL(info, container.URLByAppendingPathComponent(kMigrationMarkerName, false)) ||
-      !sl::flushDeferredSyncs()) {
+  const auto markerFailed = [&] {
     SLMigratorLog(sl::kLogLevelError, kFunctionName,
                   "SLAppMigrator: Failed to write out container marker dictionary... hopefully we don't need it to "
                   "recover.");
+  };
+  if (!sl::writePropertyListToURL(info, container.URLByAppendingPathComponent(kMigrationMarkerName, false))) {
+    markerFailed();
   }
 
   // Without a registered application there is no data container to move the
@@ -114,6 +115,11 @@ bool SLAppMigrator::_migrateContainerWithInfo(const sl::Dictionary& info) {
                   proxy->foundBackingBundle() ? "did" : "did not");
     return false;
   }
+
+  // The marker's name is on disk before anything leaves the container (its
+  // content was flushed as it was written). A placeholder's install has
+  // flushed it already, with its own changes.
+  if (!sl::flushDeferredSyncs()) markerFailed();
 
   SLMigratorLog(sl::kLogLevelNotice, kFunctionName, "SLAppMigrator: Moving data from container %@ to %@", container,
                 dataContainer);

@@ -193,13 +193,10 @@ bool writeFileAtomically(const URL& url, std::span<const uint8_t> bytes, mode_t 
   }
   // fchmod is not subject to the umask, so the file gets exactly `mode`.
   if (mut::fchmod(fd.get(), mode) != 0) return failStep(error, errno, "fchmod", tempPath);
-  // The content is on disk before the name that replaces the old one. A
-  // new name replaces nothing: while flushes are deferred, the flush that
-  // makes the name durable writes the content too.
-  struct stat existing;
-  const bool newName = tDeferred.depth > 0 && ::fstatat(dir.get(), name.c_str(), &existing, AT_SYMLINK_NOFOLLOW) != 0 &&
-                       errno == ENOENT;
-  if (!newName && mut::fsync(fd.get()) != 0) return failStep(error, errno, "fsync", tempPath);
+  // The content is on disk before the name: whatever makes the name durable
+  // (this call's flush, a later one, the file system's own commit), the
+  // file is then whole.
+  if (mut::fsync(fd.get()) != 0) return failStep(error, errno, "fsync", tempPath);
   if (::close(fd.release()) != 0) return failStep(error, errno, "close", tempPath);
 
   // rename replaces a symbolic link at the destination with the file; it

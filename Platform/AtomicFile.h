@@ -9,8 +9,8 @@
 // after the rename is reported too (the new content is then in place, its
 // durability unknown); a file system that cannot flush directories (EINVAL)
 // is not a failure. Inside a DeferredSyncs scope (below) the directory's
-// flush waits for the scope's, and so does the file's own when it makes a
-// new name.
+// flush waits for the scope's; the file's own never waits, so that the
+// name, whenever it reaches the disk, names the whole content.
 //
 // The temporary file is ".<name>.XXXXXX" (six random characters) and is
 // made with O_EXCL and O_NOFOLLOW relative to the open directory. The new
@@ -58,10 +58,9 @@ bool syncTree(const std::string& path, Error* error = nullptr);
 // emptied). While a DeferredSyncs object is alive on a thread, the calls
 // above that flush a directory (syncDirectory, syncParentDirectory, the
 // directory step of writeFileAtomically) only note the directory's file
-// system, and writeFileAtomically skips the file's own fsync when it makes
-// a new name (no older content can be lost). flushDeferredSyncs then makes
-// all of it durable with one syncfs per noted file system, which writes
-// back every change made there so far: data, names and attributes.
+// system, and flushDeferredSyncs then makes all of it durable with one
+// syncfs per noted file system, which writes back every change made there
+// so far: data, names and attributes.
 //
 // What depends on a deferred change flushes first: removefile before it
 // removes anything but an empty directory, the registry before it commits.

@@ -122,12 +122,12 @@ TEST(AtomicFileTest, DeferredFlushesWaitForWhatDependsOnThem) {
     {
       DeferredSyncs inner;
       ASSERT_TRUE(syncDirectory(disk.path()) && syncParentDirectory(disk / "old") && syncDirectory(shm.path()));
-      // A new name needs no flush of its own; a replaced one keeps its
-      // content's flush before the rename.
-      ASSERT_TRUE(writeFileAtomically(fileURL(disk / "new"), bytesOf("new"), 0644, &error)) << error.description();
       EXPECT_EQ(mut::matchedCount(), 0u);
+      // The content is flushed before its name, new or replaced; the
+      // directory waits.
+      ASSERT_TRUE(writeFileAtomically(fileURL(disk / "new"), bytesOf("new"), 0644, &error)) << error.description();
       ASSERT_TRUE(writeFileAtomically(fileURL(disk / "old"), bytesOf("newer"), 0644, &error)) << error.description();
-      EXPECT_EQ(mut::matchedCount(), 1u);
+      EXPECT_EQ(mut::matchedCount(), 2u);
       EXPECT_EQ(syncDirectory(disk / "missing", &error), false);
       EXPECT_EQ(error.localizedDescription().str(), "open of " + (disk / "missing") + " failed: No such file or directory");
     }
