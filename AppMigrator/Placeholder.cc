@@ -64,6 +64,10 @@ bool SLAppMigrator::_stageAndInstallPlaceholderForBundleAtURL(const sl::URL& bun
   }
 
   const bool result = [&]() -> bool {
+    // The placeholder is scratch until the registry has installed it, and
+    // the install's commit flushes it whole: its files wait for that flush.
+    // After a crash before it, they are made again.
+    sl::DeferredSyncs scratch(sl::DeferredSyncs::What::kDirectoriesAndContent);
     sl::Error error;
     if (!fm.createDirectoryAtURL(placeholder, true, 0755, &error)) {
       SLMigratorLog(sl::kLogLevelError, kPlaceholderFunctionName,

@@ -113,6 +113,7 @@ struct Deferred {
     std::string path;
   };
   int depth = 0;
+  int contentDepth = 0;  // scopes that defer the content of scratch files too
   std::vector<FileSystem> pending;
 };
 thread_local Deferred tDeferred;
@@ -134,9 +135,13 @@ bool syncOpenDirectory(int fd, const std::string& path, Error* error) {
 
 }  // namespace
 
-DeferredSyncs::DeferredSyncs() { ++tDeferred.depth; }
+DeferredSyncs::DeferredSyncs(What what) : what_(what) {
+  ++tDeferred.depth;
+  if (what_ == What::kDirectoriesAndContent) ++tDeferred.contentDepth;
+}
 
 DeferredSyncs::~DeferredSyncs() {
+  if (what_ == What::kDirectoriesAndContent) --tDeferred.contentDepth;
   if (--tDeferred.depth > 0) return;
   (void)flushDeferredSyncs();
   tDeferred.pending.clear();
@@ -195,8 +200,8 @@ bool writeFileAtomically(const URL& url, std::span<const uint8_t> bytes, mode_t 
   if (mut::fchmod(fd.get(), mode) != 0) return failStep(error, errno, "fchmod", tempPath);
   // The content is on disk before the name: whatever makes the name durable
   // (this call's flush, a later one, the file system's own commit), the
-  // file is then whole.
-  if (mut::fsync(fd.get()) != 0) return failStep(error, errno, "fsync", tempPath);
+  // file is then whole. A scratch file's waits for its scope's flush.
+  if (tDeferred.contentDepth == 0 && mut::fsync(fd.get()) != 0) return failStep(error, errno, "fsync", tempPath);
   if (::close(fd.release()) != 0) return failStep(error, errno, "close", tempPath);
 
   // rename replaces a symbolic link at the destination with the file; it

@@ -9,8 +9,9 @@
 // after the rename is reported too (the new content is then in place, its
 // durability unknown); a file system that cannot flush directories (EINVAL)
 // is not a failure. Inside a DeferredSyncs scope (below) the directory's
-// flush waits for the scope's; the file's own never waits, so that the
-// name, whenever it reaches the disk, names the whole content.
+// flush waits for the scope's; the file's own waits only in a scope made
+// for scratch files, so that a name, whenever it reaches the disk, names
+// the whole content.
 //
 // The temporary file is ".<name>.XXXXXX" (six random characters) and is
 // made with O_EXCL and O_NOFOLLOW relative to the open directory. The new
@@ -71,12 +72,21 @@ bool syncTree(const std::string& path, Error* error = nullptr);
 // Objects nest; the outermost one flushes what is still pending when it
 // ends, ignoring failure, so an owner on its way to success calls
 // flushDeferredSyncs itself.
+//
+// A scope made with kDirectoriesAndContent also defers the flush of the
+// content that writeFileAtomically makes, for scratch files only: after a
+// crash before the scope's flush such a file may stand whole, empty or
+// partly written, so nothing may read it back then (it is made again).
 class DeferredSyncs {
  public:
-  DeferredSyncs();
+  enum class What { kDirectories, kDirectoriesAndContent };
+  explicit DeferredSyncs(What what = What::kDirectories);
   ~DeferredSyncs();
   DeferredSyncs(const DeferredSyncs&) = delete;
   DeferredSyncs& operator=(const DeferredSyncs&) = delete;
+
+ private:
+  What what_;
 };
 
 // Flushes what this thread has deferred; true when nothing was.

@@ -128,6 +128,12 @@ TEST(AtomicFileTest, DeferredFlushesWaitForWhatDependsOnThem) {
       ASSERT_TRUE(writeFileAtomically(fileURL(disk / "new"), bytesOf("new"), 0644, &error)) << error.description();
       ASSERT_TRUE(writeFileAtomically(fileURL(disk / "old"), bytesOf("newer"), 0644, &error)) << error.description();
       EXPECT_EQ(mut::matchedCount(), 2u);
+      {
+        DeferredSyncs scratch(DeferredSyncs::What::kDirectoriesAndContent);
+        ASSERT_TRUE(writeFileAtomically(fileURL(disk / "scratch"), bytesOf("s"), 0644, &error));
+      }
+      ASSERT_TRUE(writeFileAtomically(fileURL(disk / "new"), bytesOf("new"), 0644, &error));
+      EXPECT_EQ(mut::matchedCount(), 3u) << "only a scratch file's content waits, and only in its scope";
       EXPECT_EQ(syncDirectory(disk / "missing", &error), false);
       EXPECT_EQ(error.localizedDescription().str(), "open of " + (disk / "missing") + " failed: No such file or directory");
     }
@@ -159,6 +165,7 @@ TEST(AtomicFileTest, DeferredFlushesWaitForWhatDependsOnThem) {
   EXPECT_EQ(mut::matchedCount(), 3u) << "the outermost scope flushes what is left";
   EXPECT_FALSE(deferredSyncsPending());
   EXPECT_EQ(readFile(disk / "new"), "new");
+  EXPECT_EQ(readFile(disk / "scratch"), "s");
   EXPECT_EQ(readFile(disk / "old"), "newer");
   mut::setPlanForTesting("");
 }
