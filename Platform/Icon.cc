@@ -162,40 +162,56 @@ bool readCandidate(int bundleFd, const std::string& name, std::vector<uint8_t>* 
 
 // For one axis: the source pixels each destination pixel covers, with the
 // share of the destination pixel that each of them fills (the shares of
-// one destination pixel add up to 1).
+// one destination pixel add up to 1). The taps of destination pixel d are
+// taps[first[d]] up to taps[first[d + 1]], in source order.
 struct Tap {
   uint32_t source;
   double weight;
 };
 
-std::vector<std::vector<Tap>> areaTaps(uint32_t sourceSize, uint32_t destinationSize) {
-  std::vector<std::vector<Tap>> taps(destinationSize);
+struct AxisTaps {
+  std::vector<uint32_t> first;
+  std::vector<Tap> taps;
+};
+
+AxisTaps areaTaps(uint32_t sourceSize, uint32_t destinationSize) {
+  AxisTaps axis;
+  axis.first.reserve(size_t{destinationSize} + 1);
+  // Each destination pixel covers at most ceil(scale) + 1 source pixels.
+  axis.taps.reserve(size_t{destinationSize} * (sourceSize / destinationSize + 2));
   const double scale = static_cast<double>(sourceSize) / destinationSize;
   for (uint32_t d = 0; d < destinationSize; ++d) {
+    axis.first.push_back(static_cast<uint32_t>(axis.taps.size()));
     const double begin = d * scale;
     const double end = std::min<double>((d + 1) * scale, sourceSize);
     for (auto s = static_cast<uint32_t>(begin); s < sourceSize && s < end; ++s) {
       const double overlap = std::min<double>(end, s + 1.0) - std::max<double>(begin, s);
-      if (overlap > 0) taps[d].push_back({s, overlap / scale});
+      if (overlap > 0) axis.taps.push_back({s, overlap / scale});
     }
   }
-  return taps;
+  axis.first.push_back(static_cast<uint32_t>(axis.taps.size()));
+  return axis;
 }
 
 // Scales to size x size in premultiplied alpha; the result is premultiplied
-// floats, 0 to 255 per channel.
-std::vector<float> scalePremultiplied(const Image& source, uint32_t size) {
-  const auto columns = areaTaps(source.width, size);
-  const auto rows = areaTaps(source.height, size);
+// floats, 0 to 255 per channel, size x size x 4 of them.
+//
+// Both passes accumulate in doubles starting from 0.0, tap by tap in source
+// order, and round to float once at the end; the vertical pass runs along
+// whole rows so that it vectorises, without changing that order.
+std::unique_ptr<float[]> scalePremultiplied(const Image& source, uint32_t size) {
+  const AxisTaps columns = areaTaps(source.width, size);
+  const size_t rowLength = size_t{size} * 4;
 
   // Horizontal pass: every source row to `size` premultiplied pixels.
-  std::vector<float> horizontal(size_t{size} * source.height * 4, 0.0f);
+  auto horizontal = std::make_unique_for_overwrite<float[]>(rowLength * source.height);
   for (uint32_t y = 0; y < source.height; ++y) {
     const uint8_t* in = source.pixels.data() + size_t{y} * source.width * 4;
-    float* out = horizontal.data() + size_t{y} * size * 4;
+    float* out = horizontal.get() + size_t{y} * rowLength;
     for (uint32_t x = 0; x < size; ++x) {
       double sum[4] = {0, 0, 0, 0};
-      for (const Tap& tap : columns[x]) {
+      for (uint32_t t = columns.first[x]; t < columns.first[x + 1]; ++t) {
+        const Tap& tap = columns.taps[t];
         const uint8_t* p = in + size_t{tap.source} * 4;
         const double alpha = p[3] * tap.weight;
         sum[0] += p[0] * alpha / 255.0;
@@ -206,18 +222,36 @@ std::vector<float> scalePremultiplied(const Image& source, uint32_t size) {
       for (int c = 0; c < 4; ++c) out[size_t{x} * 4 + c] = static_cast<float>(sum[c]);
     }
   }
+  // Same height: every row has the one source row as its only tap, of
+  // weight 1, and the vertical pass would give back its input unchanged.
+  if (source.height == size) return horizontal;
 
   // Vertical pass.
-  std::vector<float> result(size_t{size} * size * 4, 0.0f);
+  const AxisTaps rows = areaTaps(source.height, size);
+  auto result = std::make_unique_for_overwrite<float[]>(rowLength * size);
+  auto sum = std::make_unique_for_overwrite<double[]>(rowLength);
   for (uint32_t y = 0; y < size; ++y) {
-    for (uint32_t x = 0; x < size; ++x) {
-      double sum[4] = {0, 0, 0, 0};
-      for (const Tap& tap : rows[y]) {
-        const float* p = horizontal.data() + (size_t{tap.source} * size + x) * 4;
-        for (int c = 0; c < 4; ++c) sum[c] += p[c] * tap.weight;
-      }
-      for (int c = 0; c < 4; ++c) result[(size_t{y} * size + x) * 4 + c] = static_cast<float>(sum[c]);
+    float* out = result.get() + size_t{y} * rowLength;
+    const uint32_t firstTap = rows.first[y];
+    const uint32_t lastTap = rows.first[y + 1] - 1;  // every row covers some source row
+    auto sourceRow = [&](uint32_t t) -> const float* {
+      return horizontal.get() + size_t{rows.taps[t].source} * rowLength;
+    };
+    const float* in = sourceRow(firstTap);
+    double weight = rows.taps[firstTap].weight;
+    if (firstTap == lastTap) {
+      for (size_t i = 0; i < rowLength; ++i) out[i] = static_cast<float>(0.0 + in[i] * weight);
+      continue;
     }
+    for (size_t i = 0; i < rowLength; ++i) sum[i] = 0.0 + in[i] * weight;
+    for (uint32_t t = firstTap + 1; t < lastTap; ++t) {
+      in = sourceRow(t);
+      weight = rows.taps[t].weight;
+      for (size_t i = 0; i < rowLength; ++i) sum[i] += in[i] * weight;
+    }
+    in = sourceRow(lastTap);
+    weight = rows.taps[lastTap].weight;
+    for (size_t i = 0; i < rowLength; ++i) out[i] = static_cast<float>(sum[i] + in[i] * weight);
   }
   return result;
 }
@@ -233,6 +267,19 @@ double shapeCoverage(uint32_t x, uint32_t y, uint32_t size) {
   return std::clamp(radius - distance + 0.5, 0.0, 1.0);
 }
 
+// The coverage of every pixel of the home-screen square, row by row,
+// computed once.
+const std::vector<double>& homeScreenCoverage() {
+  static const std::vector<double> table = [] {
+    constexpr uint32_t size = kHomeScreenIconSize;
+    std::vector<double> coverage(size_t{size} * size);
+    for (uint32_t y = 0; y < size; ++y)
+      for (uint32_t x = 0; x < size; ++x) coverage[size_t{y} * size + x] = shapeCoverage(x, y, size);
+    return coverage;
+  }();
+  return table;
+}
+
 // Clamped to [0, 255] and rounded half away from zero, as lround rounds,
 // without its call: this runs four times per pixel. Between 0 and 255 the
 // fraction value - whole is exact, so the comparison decides as lround would.
@@ -243,7 +290,12 @@ uint8_t toByte(double value) {
   return static_cast<uint8_t>(whole + (value - whole >= 0.5 ? 1 : 0));
 }
 
-Image shapeAndUnpremultiply(const std::vector<float>& premultiplied, uint32_t size) {
+// The home-screen shape cut out of kHomeScreenIconSize-square premultiplied
+// pixels, in straight alpha.
+Image shapeAndUnpremultiply(const float* premultiplied) {
+  constexpr uint32_t size = kHomeScreenIconSize;
+  const double* coverageOf = homeScreenCoverage().data();
+
   Image image;
   image.width = size;
   image.height = size;
@@ -252,11 +304,11 @@ Image shapeAndUnpremultiply(const std::vector<float>& premultiplied, uint32_t si
     double previousCoverage = -1.0;  // none yet in this row
     for (uint32_t x = 0; x < size; ++x) {
       const size_t i = (size_t{y} * size + x) * 4;
-      const double coverage = shapeCoverage(x, y, size);
-      // A pixel equal to its left neighbour under the same coverage comes
-      // out the same. Scaled-up icons and flat areas are mostly such runs.
+      const double coverage = coverageOf[size_t{y} * size + x];
+      // A pixel whose bits equal its left neighbour's under the same coverage
+      // comes out the same. Scaled-up icons and flat areas are mostly such runs.
       if (coverage == previousCoverage &&
-          std::equal(premultiplied.begin() + i, premultiplied.begin() + i + 4, premultiplied.begin() + (i - 4))) {
+          std::memcmp(premultiplied + i, premultiplied + (i - 4), 4 * sizeof(float)) == 0) {
         std::copy_n(image.pixels.begin() + (i - 4), 4, image.pixels.begin() + i);
         continue;
       }
@@ -329,7 +381,7 @@ std::shared_ptr<const Image> renderHomeScreenIcon(const URL& bundle) {
   if (!best.isValid()) return nullptr;
 
   return std::make_shared<const Image>(
-      shapeAndUnpremultiply(scalePremultiplied(best, kHomeScreenIconSize), kHomeScreenIconSize));
+      shapeAndUnpremultiply(scalePremultiplied(best, kHomeScreenIconSize).get()));
 }
 
 }  // namespace sl

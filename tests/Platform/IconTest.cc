@@ -120,6 +120,41 @@ TEST(Icon, RendersToTheHomeScreenShapeAndEncodes) {
   EXPECT_EQ((Pixel{edge[0], edge[1], edge[2], 255}), colour);
 }
 
+TEST(Icon, SameSizeSourceMatchesTheScaledPath) {
+  // A source already 120 pixels high skips the vertical pass. The same
+  // picture at twice the size, each pixel a 2 x 2 block, goes through both
+  // passes with weights of exactly one half and must come out identical.
+  test::TempDir tmp;
+  Image same{120, 120, {}};
+  Image doubled{240, 240, std::vector<uint8_t>(size_t{240} * 240 * 4)};
+  uint32_t seed = 12345;
+  for (uint32_t i = 0; i < 120 * 120; ++i) {
+    seed = seed * 1103515245 + 12345;
+    const Pixel p{uint8_t(seed >> 8), uint8_t(seed >> 16), uint8_t(seed >> 24), uint8_t(i % 7 == 0 ? 0 : seed >> 4)};
+    same.pixels.insert(same.pixels.end(), p.begin(), p.end());
+    const uint32_t x = i % 120 * 2;
+    const uint32_t y = i / 120 * 2;
+    for (uint32_t row : {y, y + 1})
+      for (uint32_t column : {x, x + 1})
+        std::copy(p.begin(), p.end(), doubled.pixels.begin() + (size_t{row} * 240 + column) * 4);
+  }
+  writeBytes(tmp / "Same.app/Icon.png", encode(same));
+  writeBytes(tmp / "Doubled.app/Icon.png", encode(doubled));
+  std::shared_ptr<const Image> direct = renderHomeScreenIcon(dirURL(tmp / "Same.app"));
+  std::shared_ptr<const Image> scaled = renderHomeScreenIcon(dirURL(tmp / "Doubled.app"));
+  ASSERT_TRUE(direct);
+  ASSERT_TRUE(scaled);
+  EXPECT_TRUE(direct->pixels == scaled->pixels);
+  // Away from the corners the source comes back unchanged, colour 0 where
+  // it is transparent.
+  for (uint32_t y = 30; y < 90; ++y)
+    for (uint32_t x = 30; x < 90; ++x) {
+      const Pixel source = at(same, x, y);
+      const Pixel expected = source[3] == 0 ? Pixel{0, 0, 0, 0} : source;
+      ASSERT_EQ(at(*direct, x, y), expected) << x << "," << y;
+    }
+}
+
 TEST(Icon, CandidateChoice) {
   test::TempDir tmp;
   const std::vector<uint8_t> valid = encode(solid(64, 64, {0, 0, 255, 255}));
