@@ -175,12 +175,8 @@ TEST_F(HostileContainerTest, MountInsideAContainer) {
     const std::string mountPoint = oldEntry("C") + (withBundle ? "/Documents" : "/Stuff");
     if (withBundle) makeBundle(oldEntry("C") + "/A.app", "com.a");
     makeDirs(mountPoint);
-    if (::mount("hostile", mountPoint.c_str(), "tmpfs", 0, "size=4m") != 0)
-      GTEST_SKIP() << "cannot mount a tmpfs here: " << strerror(errno);
-    struct Unmount {
-      std::string at;
-      ~Unmount() { ::umount2(at.c_str(), MNT_DETACH); }
-    } unmount{mountPoint};
+    sl::test::ScopedTmpfs mount(mountPoint);
+    if (!mount.mounted()) GTEST_SKIP() << "cannot mount a tmpfs here: " << mount.error();
     Sentinel sentinel(mountPoint.c_str());
     EXPECT_FALSE(migrate());
     EXPECT_EQ(exists(oldEntry("C") + "/A.app"), withBundle);

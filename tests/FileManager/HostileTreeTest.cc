@@ -222,12 +222,8 @@ TEST(HostileTree, MountInsideTheTreeIsNotEntered) {
   TempDir tmp(TempDir::kShm);
   const std::string tree = tmp / "tree", mountPoint = tree + "/mnt";
   makeDirs(mountPoint);
-  if (::mount("hostile", mountPoint.c_str(), "tmpfs", 0, "size=4m") != 0)
-    GTEST_SKIP() << "cannot mount a tmpfs here: " << strerror(errno);
-  struct Unmount {
-    std::string at;
-    ~Unmount() { ::umount2(at.c_str(), MNT_DETACH); }
-  } unmount{mountPoint};
+  sl::test::ScopedTmpfs mount(mountPoint);
+  if (!mount.mounted()) GTEST_SKIP() << "cannot mount a tmpfs here: " << mount.error();
   Sentinel sentinel(mountPoint.c_str());
   writeFile(tree + "/own", "x", 0600);
   LogCapture log;

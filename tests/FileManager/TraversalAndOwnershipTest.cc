@@ -214,10 +214,8 @@ TEST(TraversalAndOwnership, MountedVolumeIsNotEntered) {
   const std::string root = tmp / "root", mountPoint = root + "/mnt";
   makeDirs(mountPoint);
   writeFile(root + "/outer", "", 0600);
-  if (mount("tmpfs", mountPoint.c_str(), "tmpfs", 0, "size=1m") != 0) {
-    GTEST_SKIP() << "cannot mount a tmpfs: " << strerror(errno);
-  }
-  ScopeExit unmount{[&] { umount2(mountPoint.c_str(), MNT_DETACH); }};
+  sl::test::ScopedTmpfs mount(mountPoint);
+  if (!mount.mounted()) GTEST_SKIP() << "cannot mount a tmpfs: " << mount.error();
   writeFile(mountPoint + "/inner", "", 0600);
   sl::Error err;
 

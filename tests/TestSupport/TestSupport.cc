@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <ftw.h>
 #include <sys/fsuid.h>
+#include <sys/mount.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -144,5 +145,15 @@ ScopedUnprivileged::~ScopedUnprivileged() {
   setfsuid(oldUid_);
   setfsgid(oldGid_);
 }
+
+ScopedTmpfs::ScopedTmpfs(std::string at) : at_(std::move(at)) {
+  if (::mount("tmpfs", at_.c_str(), "tmpfs", 0, "size=4m") != 0) error_ = errno;
+}
+
+ScopedTmpfs::~ScopedTmpfs() {
+  if (mounted()) ::umount2(at_.c_str(), MNT_DETACH);
+}
+
+const char* ScopedTmpfs::error() const { return strerror(error_); }
 
 }  // namespace sl::test

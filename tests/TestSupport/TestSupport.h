@@ -116,4 +116,21 @@ class ScopedUnprivileged {
   gid_t oldGid_;
 };
 
+// A small tmpfs mounted on the existing directory `at` while it lives, and
+// lazily detached when it ends. Where this process may not mount,
+// mounted() is false and error() says why (the test then skips).
+class ScopedTmpfs {
+ public:
+  explicit ScopedTmpfs(std::string at);
+  ~ScopedTmpfs();
+  ScopedTmpfs(const ScopedTmpfs&) = delete;
+  ScopedTmpfs& operator=(const ScopedTmpfs&) = delete;
+  bool mounted() const { return error_ == 0; }
+  const char* error() const;
+
+ private:
+  std::string at_;
+  int error_ = 0;
+};
+
 }  // namespace sl::test
