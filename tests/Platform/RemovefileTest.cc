@@ -204,20 +204,20 @@ TEST(Removefile, LargeTreeWalkedInParallel) {
   writeFile(dir / "outside/precious", "keep");
   sl::test::ScopedUnprivileged nobody;
   // Enough entries at the top that the walk turns parallel at once.
-  auto build = [&](const std::string& top, int lockedFrom) {
+  auto build = [&](const std::string& top) {
     for (int f = 0; f < 520; ++f) writeFile(top + "/t" + std::to_string(f));
     for (int d = 0; d < 40; ++d) {
       const std::string sub = top + "/d" + std::to_string(d) + "/e/f";
       for (int f = 0; f < 24; ++f) writeFile(sub + "/" + std::to_string(f));
       makeSymlink(dir / "outside", sub + "/link");
-      if (d % 10 == 7 && d >= lockedFrom) {
+      if (d % 10 == 7) {
         writeFile(sub + "/locked/kept");
         ASSERT_EQ(chmod((sub + "/locked").c_str(), 0), 0);
       }
     }
   };
-  build(dir / "proceed", 0);
-  build(dir / "stop", 30);
+  build(dir / "proceed");
+  build(dir / "stop");
 
   const std::string top = dir / "proceed";
   const auto [result, err, reports] = removeWith(top);
@@ -245,8 +245,13 @@ TEST(Removefile, LargeTreeWalkedInParallel) {
   for (const char* gone : {"/d0", "/d37/e/f/0", "/d37/e/f/link"}) EXPECT_FALSE(exists(top + gone)) << gone;
   EXPECT_EQ(readFile(dir / "outside/precious"), "keep");
 
-  EXPECT_EQ(removeWith(dir / "stop", sl::REMOVEFILE_STOP),
-            (Outcome{-1, EACCES, {{dir / "stop/d37/e/f/locked", EACCES}}}));
+  // Several threads may meet a locked directory at once; the callback hears
+  // of the first only, and the others stop without asking.
+  const auto [stopResult, stopErr, stopReports] = removeWith(dir / "stop", sl::REMOVEFILE_STOP);
+  EXPECT_EQ(std::pair(stopResult, stopErr), std::pair(-1, EACCES));
+  ASSERT_EQ(stopReports.size(), 1u);
+  EXPECT_TRUE(stopReports[0].first.ends_with("/e/f/locked")) << stopReports[0].first;
+  EXPECT_EQ(stopReports[0].second, EACCES);
 }
 
 }  // namespace
