@@ -25,10 +25,6 @@ int configCommand(Arguments args);
 int manifestCommand(Arguments args);
 int verifyCommand(Arguments args);
 
-// The value of the option at args[*i]: the next argument when there is one
-// and it is not empty, with *i moved onto it; nullopt otherwise.
-std::optional<std::string> optionValue(Arguments args, size_t* i);
-
 // "stowline <command>: <message>" and a hint at --help on standard error;
 // returns 2. For mistakes in the command line itself.
 int usageError(std::string_view command, std::string_view message);

@@ -15,11 +15,6 @@ int usageError(std::string_view command, std::string_view message) {
   return 2;
 }
 
-std::optional<std::string> optionValue(Arguments args, size_t* i) {
-  if (*i + 1 >= args.size() || args[*i + 1][0] == '\0') return std::nullopt;
-  return std::string(args[++*i]);
-}
-
 int setupError(std::string_view command, std::string_view message) {
   std::fprintf(stderr, "stowline %.*s: %.*s\n", static_cast<int>(command.size()), command.data(),
                static_cast<int>(message.size()), message.data());

@@ -15,6 +15,7 @@
 
 #include "Configuration/SLGlobalConfiguration.h"
 #include "Platform/SystemRoot.h"
+#include "tools/CommandLine.h"
 #include "tools/Commands.h"
 #include "tools/Json.h"
 
@@ -126,21 +127,9 @@ std::vector<Section> collect(SLGlobalConfiguration& c) {
 int configCommand(Arguments args) {
   std::string root;
   bool json = false;
-  for (size_t i = 0; i < args.size(); ++i) {
-    const std::string_view arg = args[i];
-    if (arg == "--help" || arg == "-h") {
-      std::fputs(kHelp, stdout);
-      return 0;
-    } else if (arg == "--root") {
-      std::optional<std::string> value = optionValue(args, &i);
-      if (!value) return usageError("config", "--root needs a directory");
-      root = *value;
-    } else if (arg == "--json") {
-      json = true;
-    } else {
-      return usageError("config", "unknown option '" + std::string(arg) + "'");
-    }
-  }
+  CommandLine line("config", kHelp);
+  line.value("--root", "a directory", &root).flag("--json", &json);
+  if (std::optional<int> status = line.parse(args)) return *status;
   if (!applyRoot("config", root)) return 2;
 
   const std::vector<Section> sections = collect(SLGlobalConfiguration::sharedInstance());

@@ -11,6 +11,7 @@
 #include "Platform/InstallerLog.h"
 #include "Platform/URL.h"
 #include "Support/Digest.h"
+#include "tools/CommandLine.h"
 #include "tools/Commands.h"
 
 namespace stowline {
@@ -45,21 +46,8 @@ std::string line(const std::string& digest, std::string_view path) {
 }  // namespace
 
 int digestCommand(Arguments args) {
-  std::vector<std::string_view> files;
-  bool options = true;
-  for (const char* arg : args) {
-    const std::string_view a = arg;
-    if (options && a == "--") {
-      options = false;
-    } else if (options && (a == "--help" || a == "-h")) {
-      std::fputs(kHelp, stdout);
-      return 0;
-    } else if (options && a.size() > 1 && a[0] == '-') {
-      return usageError("digest", "unknown option '" + std::string(a) + "'");
-    } else {
-      files.push_back(a);
-    }
-  }
+  std::vector<std::string> files;
+  if (std::optional<int> status = CommandLine("digest", kHelp).operands(&files).parse(args)) return *status;
   if (files.empty()) return usageError("digest", "no file given");
 
   // The digest explains a failure in the installer log: keep the reader's

@@ -34,6 +34,7 @@
 #include "Platform/SystemRoot.h"
 #include "Platform/UniqueFd.h"
 #include "Platform/Value.h"
+#include "tools/CommandLine.h"
 #include "tools/Commands.h"
 
 namespace stowline {
@@ -636,13 +637,13 @@ int FixtureWriter::run() {
   return 0;
 }
 
-bool parseCount(std::string_view option, std::string_view text, uint64_t* out) {
+// Stores the count; answers why it is refused, or "".
+std::string parseCount(std::string_view option, std::string_view text, uint64_t* out) {
   const auto [end, ec] = std::from_chars(text.data(), text.data() + text.size(), *out);
   if (ec != std::errc() || end != text.data() + text.size() || text.empty()) {
-    usageError(kCommand, std::string(option) + " takes a whole number of 0 or more, not '" + std::string(text) + "'");
-    return false;
+    return std::string(option) + " takes a whole number of 0 or more, not '" + std::string(text) + "'";
   }
-  return true;
+  return {};
 }
 
 // The layout must be new: an old container root with something in it, or a
@@ -680,40 +681,24 @@ bool checkLayoutIsNew(const std::string& oldRoot, const std::string& installMap,
 
 int fixtureCommand(Arguments args) {
   Options options;
-  for (size_t i = 0; i < args.size(); ++i) {
-    const std::string_view arg = args[i];
-    if (arg == "--help" || arg == "-h") {
-      std::fputs(kUsage, stdout);
-      return 0;
-    }
-    struct Counted {
-      const char* name;
-      uint64_t* value;
-    };
-    const Counted counted[] = {{"--apps", &options.apps},
-                               {"--vpn-only", &options.vpnOnly},
-                               {"--groups", &options.groups},
-                               {"--files-per-app", &options.filesPerApp},
-                               {"--bytes-per-file", &options.bytesPerFile},
-                               {"--seed", &options.seed},
-                               {"--app-vpn", &options.appVPN},
-                               {"--placeholders", &options.placeholders},
-                               {"--builtin", &options.builtIn}};
-    bool known = arg == "--root";
-    for (const Counted& c : counted) known = known || arg == c.name;
-    if (!known) return usageError(kCommand, "unknown option '" + std::string(arg) + "'");
-    if (i + 1 >= args.size()) return usageError(kCommand, std::string(arg) + " needs a value");
-    const std::string_view value = args[++i];
-    if (arg == "--root") {
-      options.root = value;
-      if (options.root.empty()) return usageError(kCommand, "--root needs a directory");
-      continue;
-    }
-    for (const Counted& c : counted) {
-      if (arg == c.name && !parseCount(arg, value, c.value)) return 2;
-    }
-    if (arg == "--apps") options.haveApps = true;
-  }
+  CommandLine line(kCommand, kUsage);
+  line.value("--root", "a directory", &options.root);
+  line.value("--apps", "a number", [&options](std::string_view text) {
+    options.haveApps = true;
+    return parseCount("--apps", text, &options.apps);
+  });
+  const auto count = [&](std::string_view name, uint64_t* out) {
+    line.value(name, "a number", [name, out](std::string_view text) { return parseCount(name, text, out); });
+  };
+  count("--vpn-only", &options.vpnOnly);
+  count("--groups", &options.groups);
+  count("--files-per-app", &options.filesPerApp);
+  count("--bytes-per-file", &options.bytesPerFile);
+  count("--seed", &options.seed);
+  count("--app-vpn", &options.appVPN);
+  count("--placeholders", &options.placeholders);
+  count("--builtin", &options.builtIn);
+  if (std::optional<int> status = line.parse(args)) return *status;
   if (options.root.empty()) return usageError(kCommand, "--root DIR is required");
   if (!options.haveApps) return usageError(kCommand, "--apps N is required");
   if (!applyRoot(kCommand, options.root)) return 2;

@@ -27,6 +27,7 @@
 #include "Platform/PropertyList.h"
 #include "Platform/SystemRoot.h"
 #include "Platform/UniqueFd.h"
+#include "tools/CommandLine.h"
 #include "tools/Commands.h"
 #include "tools/ManifestItem.h"
 #include "tools/Json.h"
@@ -239,22 +240,9 @@ std::optional<ManifestItem> describeManifestItem(int baseFd, const std::string& 
 
 int manifestCommand(Arguments args) {
   std::string root, output;
-  for (size_t i = 0; i < args.size(); ++i) {
-    const std::string_view arg = args[i];
-    if (arg == "--help" || arg == "-h") {
-      std::fputs(kUsage, stdout);
-      return 0;
-    }
-    if (arg == "--root" || arg == "--output") {
-      std::optional<std::string> value = optionValue(args, &i);
-      if (!value) {
-        return usageError(kCommand, std::string(arg) + (arg == "--root" ? " needs a directory" : " needs a file"));
-      }
-      (arg == "--root" ? root : output) = *value;
-    } else {
-      return usageError(kCommand, "unknown option '" + std::string(arg) + "'");
-    }
-  }
+  CommandLine line(kCommand, kUsage);
+  line.value("--root", "a directory", &root).value("--output", "a file", &output);
+  if (std::optional<int> status = line.parse(args)) return *status;
   if (!applyRoot(kCommand, root)) return 2;
 
   // Errors of the classification still reach the user; its notices do not.

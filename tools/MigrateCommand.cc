@@ -44,6 +44,7 @@
 #include "Platform/UniqueFd.h"
 #include "Registry/EmbeddedRegistry.h"
 #include "Support/Log.h"
+#include "tools/CommandLine.h"
 #include "tools/Commands.h"
 #include "tools/Json.h"
 
@@ -94,66 +95,39 @@ struct Options {
   bool trustMarkers = false;
 };
 
-// One line of the program's own on standard error; always 2.
-int fatal(const std::string& message) {
-  std::fprintf(stderr, "stowline %s: %s\n", kCommand, message.c_str());
-  return 2;
-}
-
 // Parses the options; nullopt with the exit status in `status` when the
 // command must stop (a usage error, or --help).
 std::optional<Options> parse(Arguments args, int* status) {
   Options options;
-  for (size_t i = 0; i < args.size(); ++i) {
-    const std::string_view arg = args[i];
-    const auto value = [&](std::string* out) {
-      if (i + 1 >= args.size() || args[i + 1][0] == '\0') {
-        *status = usageError(kCommand, "option " + std::string(arg) + " needs a value");
-        return false;
-      }
-      *out = args[++i];
-      return true;
-    };
-    std::string text;
-    if (arg == "--help" || arg == "-h") {
-      std::fputs(kHelp, stdout);
-      *status = 0;
-      return std::nullopt;
-    } else if (arg == "--root") {
-      if (!value(&options.root)) return std::nullopt;
-    } else if (arg == "--plugin") {
-      if (!value(&options.plugin)) return std::nullopt;
-    } else if (arg == "--log-file") {
-      if (!value(&options.logFile)) return std::nullopt;
-    } else if (arg == "--log-format") {
-      if (!value(&text)) return std::nullopt;
-      if (text != "text" && text != "jsonl") {
-        *status = usageError(kCommand, "unknown log format '" + text + "' (text or jsonl)");
-        return std::nullopt;
-      }
-      options.jsonl = text == "jsonl";
-    } else if (arg == "--log-level") {
-      if (!value(&text)) return std::nullopt;
-      if (text == "error") {
-        options.logLevel = sl::kLogLevelError;
-      } else if (text == "notice") {
-        options.logLevel = sl::kLogLevelNotice;
-      } else if (text == "debug") {
-        options.logLevel = sl::kLogLevelDebug;
-      } else {
-        *status = usageError(kCommand, "unknown log level '" + text + "' (error, notice or debug)");
-        return std::nullopt;
-      }
-    } else if (arg == "--json") {
-      options.json = true;
-    } else if (arg == "--no-progress") {
-      options.noProgress = true;
-    } else if (arg == "--trust-markers") {
-      options.trustMarkers = true;
+  const auto logFormat = [&](std::string_view text) {
+    if (text != "text" && text != "jsonl") return "unknown log format '" + std::string(text) + "' (text or jsonl)";
+    options.jsonl = text == "jsonl";
+    return std::string();
+  };
+  const auto logLevel = [&](std::string_view text) {
+    if (text == "error") {
+      options.logLevel = sl::kLogLevelError;
+    } else if (text == "notice") {
+      options.logLevel = sl::kLogLevelNotice;
+    } else if (text == "debug") {
+      options.logLevel = sl::kLogLevelDebug;
     } else {
-      *status = usageError(kCommand, "unknown option '" + std::string(arg) + "'");
-      return std::nullopt;
+      return "unknown log level '" + std::string(text) + "' (error, notice or debug)";
     }
+    return std::string();
+  };
+  CommandLine line(kCommand, kHelp);
+  line.value("--root", "a directory", &options.root)
+      .value("--plugin", "a file", &options.plugin)
+      .value("--log-file", "a file", &options.logFile)
+      .value("--log-format", "text or jsonl", logFormat)
+      .value("--log-level", "error, notice or debug", logLevel)
+      .flag("--json", &options.json)
+      .flag("--no-progress", &options.noProgress)
+      .flag("--trust-markers", &options.trustMarkers);
+  if (std::optional<int> stop = line.parse(args)) {
+    *status = *stop;
+    return std::nullopt;
   }
   return options;
 }
@@ -471,7 +445,7 @@ int migrateCommand(Arguments args) {
   if (!applyRoot(kCommand, options.root)) return 2;
   struct stat rootStatus;
   if (::stat(sl::systemRoot().c_str(), &rootStatus) != 0 || !S_ISDIR(rootStatus.st_mode))
-    return fatal("root " + sl::systemRoot() + " is not a directory");
+    return setupError(kCommand, "root " + sl::systemRoot() + " is not a directory");
 
   // 2. The migration markers. The plug-in acts on a marker's paths as they
   //    stand; one that leads outside the old layout stops the run here,
@@ -485,7 +459,7 @@ int migrateCommand(Arguments args) {
         message += "; " + std::to_string(more) + (more == 1 ? " more marker names" : " more markers name") +
                    " paths outside the old layout";
       }
-      return fatal(message + "; nothing was changed (--trust-markers uses markers as they stand)");
+      return setupError(kCommand, message + "; nothing was changed (--trust-markers uses markers as they stand)");
     }
   }
 
@@ -494,19 +468,19 @@ int migrateCommand(Arguments args) {
   if (!options.logFile.empty()) {
     logFile.reset(::open(options.logFile.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
     const int openErrno = errno;
-    if (!logFile) return fatal("cannot open log file " + options.logFile + ": " + std::strerror(openErrno));
+    if (!logFile) return setupError(kCommand, "cannot open log file " + options.logFile + ": " + std::strerror(openErrno));
   }
 
   // 4. The plug-in and its two entry points. It stays loaded until the
   //    process ends.
   const std::string pluginPath = options.plugin.empty() ? defaultPluginPath() : options.plugin;
   void* plugin = ::dlopen(pluginPath.c_str(), RTLD_NOW | RTLD_LOCAL);
-  if (plugin == nullptr) return fatal(std::string("cannot load the plug-in: ") + ::dlerror());
+  if (plugin == nullptr) return setupError(kCommand, std::string("cannot load the plug-in: ") + ::dlerror());
   const auto create = reinterpret_cast<DataClassMigratorCreateFunction>(::dlsym(plugin, kDataClassMigratorEntryPoint));
-  if (create == nullptr) return fatal(std::string("not a migration plug-in: ") + ::dlerror());
+  if (create == nullptr) return setupError(kCommand, std::string("not a migration plug-in: ") + ::dlerror());
   const auto release =
       reinterpret_cast<DataClassMigratorReleaseFunction>(::dlsym(plugin, kDataClassMigratorReleasePoint));
-  if (release == nullptr) return fatal(std::string("not a migration plug-in: ") + ::dlerror());
+  if (release == nullptr) return setupError(kCommand, std::string("not a migration plug-in: ") + ::dlerror());
 
   // 5. The logs. The installer log's call sites filter by the handle's
   //    threshold (debug lines need one); the host log is filtered here.
@@ -520,13 +494,13 @@ int migrateCommand(Arguments args) {
   // 6. The registry of the root, as the default workspace and library.
   sl::Error error;
   std::shared_ptr<EmbeddedRegistry> registry = EmbeddedRegistry::open(SLGlobalConfiguration::sharedInstance(), &error);
-  if (!registry) return fatal("cannot open the registry: " + error.description());
+  if (!registry) return setupError(kCommand, "cannot open the registry: " + error.description());
   ScopedRegistry defaults(std::move(registry));
 
   // 7. The migrator; its init loads the start-up state.
   const auto releaseMigrator = [release](DataClassMigrator* m) { release(m); };
   std::unique_ptr<DataClassMigrator, decltype(releaseMigrator)> migrator(create(), releaseMigrator);
-  if (!migrator) return fatal("the plug-in made no migrator (its init failed)");
+  if (!migrator) return setupError(kCommand, "the plug-in made no migrator (its init failed)");
 
   const float estimate = migrator->estimatedDuration();
   const uint64_t items = itemsFromEstimate(estimate);

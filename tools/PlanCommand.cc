@@ -35,6 +35,7 @@
 #include "Platform/SystemRoot.h"
 #include "Platform/UniqueFd.h"
 #include "Registry/EmbeddedRegistry.h"
+#include "tools/CommandLine.h"
 #include "tools/Commands.h"
 #include "tools/Json.h"
 
@@ -436,22 +437,9 @@ std::vector<std::string> names(const std::vector<std::string>& paths) {
 int planCommand(Arguments args) {
   std::string root;
   bool json = false;
-  for (size_t i = 0; i < args.size(); ++i) {
-    const std::string_view arg = args[i];
-    if (arg == "--help" || arg == "-h") {
-      std::fputs(kUsage, stdout);
-      return 0;
-    }
-    if (arg == "--json") {
-      json = true;
-    } else if (arg == "--root") {
-      std::optional<std::string> value = optionValue(args, &i);
-      if (!value) return usageError(kCommand, "--root needs a directory");
-      root = *value;
-    } else {
-      return usageError(kCommand, "unknown option '" + std::string(arg) + "'");
-    }
-  }
+  CommandLine line(kCommand, kUsage);
+  line.value("--root", "a directory", &root).flag("--json", &json);
+  if (std::optional<int> status = line.parse(args)) return *status;
   if (!applyRoot(kCommand, root)) return 2;
 
   // The installer log's errors still reach the user; its notices do not

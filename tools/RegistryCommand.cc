@@ -20,6 +20,7 @@
 #include "Platform/Bundle.h"
 #include "Platform/URL.h"
 #include "Registry/EmbeddedRegistry.h"
+#include "tools/CommandLine.h"
 #include "tools/Commands.h"
 #include "tools/Json.h"
 
@@ -265,26 +266,9 @@ int registryCommand(Arguments args) {
   bool asJson = false;
   bool placeholder = false;
   std::vector<std::string> words;  // the action and its operand
-  for (size_t i = 0; i < args.size(); ++i) {
-    const std::string_view arg = args[i];
-    if (arg == "--help" || arg == "-h") {
-      std::fputs(kUsage, stdout);
-      return 0;
-    }
-    if (arg == "--root") {
-      std::optional<std::string> value = optionValue(args, &i);
-      if (!value) return usageError(kCommand, "--root needs a directory");
-      root = *value;
-    } else if (arg == "--json") {
-      asJson = true;
-    } else if (arg == "--placeholder") {
-      placeholder = true;
-    } else if (arg.starts_with("-") && arg.size() > 1) {
-      return usageError(kCommand, "unknown option '" + std::string(arg) + "'");
-    } else {
-      words.emplace_back(arg);
-    }
-  }
+  CommandLine line(kCommand, kUsage);
+  line.value("--root", "a directory", &root).flag("--json", &asJson).flag("--placeholder", &placeholder);
+  if (std::optional<int> status = line.operands(&words).parse(args)) return *status;
   if (words.empty()) return usageError(kCommand, "an action is required: list, show, install or harbors");
   const std::string& action = words[0];
   const bool takesOperand = action == "show" || action == "install";

@@ -24,6 +24,7 @@
 #include "Platform/URL.h"
 #include "Platform/UniqueFd.h"
 #include "Registry/EmbeddedRegistry.h"
+#include "tools/CommandLine.h"
 #include "tools/Commands.h"
 #include "tools/ManifestItem.h"
 #include "tools/Json.h"
@@ -183,29 +184,15 @@ std::string pathOf(const sl::URL& url) { return url.isNull() ? std::string() : u
 }  // namespace
 
 int verifyCommand(Arguments args) {
-  std::string root, manifestPath;
+  std::string root;
   bool json = false;
-  for (size_t i = 0; i < args.size(); ++i) {
-    const std::string_view arg = args[i];
-    if (arg == "--help" || arg == "-h") {
-      std::fputs(kUsage, stdout);
-      return 0;
-    }
-    if (arg == "--json") {
-      json = true;
-    } else if (arg == "--root") {
-      std::optional<std::string> value = optionValue(args, &i);
-      if (!value) return usageError(kCommand, "--root needs a directory");
-      root = *value;
-    } else if (!arg.empty() && arg[0] == '-') {
-      return usageError(kCommand, "unknown option '" + std::string(arg) + "'");
-    } else if (!manifestPath.empty()) {
-      return usageError(kCommand, "only one manifest can be given");
-    } else {
-      manifestPath = arg;
-    }
-  }
-  if (manifestPath.empty()) return usageError(kCommand, "a manifest is needed");
+  std::vector<std::string> manifests;
+  CommandLine line(kCommand, kUsage);
+  line.value("--root", "a directory", &root).flag("--json", &json).operands(&manifests);
+  if (std::optional<int> status = line.parse(args)) return *status;
+  if (manifests.empty()) return usageError(kCommand, "a manifest is needed");
+  if (manifests.size() > 1) return usageError(kCommand, "only one manifest can be given");
+  const std::string& manifestPath = manifests[0];
 
   int err = 0;
   const std::optional<std::string> text = readFile(manifestPath, &err);

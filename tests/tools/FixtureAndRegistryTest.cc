@@ -89,7 +89,7 @@ TEST(FixtureTest, RefusesWhatItMustNotWriteInto) {
       {{"--root", dir.path(), "--apps", "-1"}, "--apps takes a whole number of 0 or more, not '-1'", true},
       {{"--apps", "1"}, "--root DIR is required", true},
       {{"--root", dir.path(), "--apps", "1", "--colour"}, "unknown option '--colour'", true},
-      {{"--root", dir.path(), "--apps"}, "--apps needs a value", true},
+      {{"--root", dir.path(), "--apps"}, "--apps needs a number", true},
   };
   for (const Case& c : cases) {
     std::vector<std::string> args = c.args;

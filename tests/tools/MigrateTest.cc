@@ -113,8 +113,10 @@ TEST(MigrateTest, UsageErrorsChangeNothing) {
   const std::string file = root.path() + kOldRoot + "/C/A.app/Exec";
   const std::vector<Case> cases = {
       {{"--bogus"}, "unknown option '--bogus'", false},
-      {{"--root"}, "option --root needs a value", false},
+      {{"--root"}, "--root needs a directory", false},
       {{"--log-format", "xml"}, "unknown log format 'xml'", false},
+      {{"--log-level", ""}, "--log-level needs error, notice or debug", false},
+      {{"now"}, "unexpected argument 'now'", false},
       {{"--root", root / "missing"}, "does not exist", false},
       {{"--root", file}, "is not a directory", false},
       {{"--plugin", root / "missing.so"}, "cannot load the plug-in: ", true},
