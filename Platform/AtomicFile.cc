@@ -220,40 +220,6 @@ bool writeFileAtomically(const URL& url, std::span<const uint8_t> bytes, mode_t 
   return true;
 }
 
-namespace {
-
-// Flushes what `fd` (open on `path`) holds, then `fd` itself.
-bool syncTreeAt(int fd, const std::string& path, int depth, Error* error) {
-  struct stat st;
-  if (::fstat(fd, &st) != 0) return failStep(error, errno, "fstat", path);
-  if (S_ISDIR(st.st_mode)) {
-    if (depth > 256) return failStep(error, ELOOP, "walk", path);
-    std::vector<std::string> names;
-    {
-      UniqueFd copy(::openat(fd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-      if (!copy) return failStep(error, errno, "open", path);
-      UniqueDir dir = fdopendir(copy);
-      if (!dir) return failStep(error, errno, "opendir", path);
-      while (const struct dirent* entry = ::readdir(dir.get())) {
-        const std::string name = entry->d_name;
-        if (name != "." && name != "..") names.push_back(name);
-      }
-    }
-    for (const std::string& name : names) {
-      const std::string child = path + "/" + name;
-      struct stat childStat;
-      if (::fstatat(fd, name.c_str(), &childStat, AT_SYMLINK_NOFOLLOW) != 0) return failStep(error, errno, "stat", child);
-      if (!S_ISDIR(childStat.st_mode) && !S_ISREG(childStat.st_mode)) continue;  // links, fifos, devices
-      UniqueFd childFd(::openat(fd, name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-      if (!childFd) return failStep(error, errno, "open", child);
-      if (!syncTreeAt(childFd.get(), child, depth + 1, error)) return false;
-    }
-  }
-  return syncDescriptor(fd, path, error);
-}
-
-}  // namespace
-
 bool syncDirectory(const std::string& path, Error* error) {
   UniqueFd fd(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!fd) return failStep(error, errno, "open", path);
@@ -270,13 +236,18 @@ bool syncParentDirectory(const std::string& path, Error* error) {
 }
 
 bool syncTree(const std::string& path, Error* error) {
+  // The item itself, or for one that cannot be opened so (a link, a socket)
+  // the directory that holds it: either is on the tree's file system.
+  std::string opened = path;
   UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
   if (!fd) {
-    const int openErrno = errno;
-    if (openErrno == ELOOP) return true;  // a link: nothing of its own to flush
-    return failStep(error, openErrno, "open", path);
+    const size_t slash = path.find_last_of('/');
+    opened = slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
+    fd = UniqueFd(::open(opened.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!fd) return failStep(error, errno, "open", opened);
   }
-  return syncTreeAt(fd.get(), path, 0, error);
+  if (mut::syncfs(fd.get()) != 0) return failStep(error, errno, "syncfs", path);
+  return true;
 }
 
 }  // namespace sl

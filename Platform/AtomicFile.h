@@ -47,9 +47,9 @@ bool writeFileAtomically(const URL& url, std::span<const uint8_t> bytes, mode_t 
 // syncDirectory: the entries of the directory at `path` (names made,
 // renamed or removed in it). syncParentDirectory: those of the directory
 // that holds `path` (nothing is done for a path without a parent).
-// syncTree: every file and directory of the tree at `path`, deepest first,
-// links neither followed nor flushed; for a copy that must be whole on disk
-// before it is renamed into place or its source is removed.
+// syncTree: everything of the tree at `path`, whatever its depth and kinds
+// of files, with one syncfs of its file system ("syncfs of <path> failed");
+// for a copy that must be whole on disk before its source is removed.
 bool syncDirectory(const std::string& path, Error* error = nullptr);
 bool syncParentDirectory(const std::string& path, Error* error = nullptr);
 bool syncTree(const std::string& path, Error* error = nullptr);

@@ -1,4 +1,6 @@
 #include <fcntl.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -133,8 +135,12 @@ class CrossVolume : public testing::Test {
 };
 
 TEST_F(CrossVolume, MoveCopiesThenRemovesOrLogsSource) {
-  // Modes, a link inside, a fifo and an extended attribute come along.
+  // Modes, a link inside, a fifo, an extended attribute and a chain of
+  // directories deeper than any walk would recurse come along.
   const std::string src = shm / "src";
+  std::string deep = src;
+  for (int i = 0; i < 300; ++i) deep += "/d";
+  writeFile(deep + "/bottom", "deep");
   writeFile(src + "/file", "data", 0640);
   makeDirs(src + "/sub", 0700);
   makeSymlink("../file", src + "/sub/link");
@@ -154,11 +160,24 @@ TEST_F(CrossVolume, MoveCopiesThenRemovesOrLogsSource) {
   EXPECT_EQ(getxattr((disk / "dst/file").c_str(), "user.test", value, sizeof value), 1);
   EXPECT_STREQ(value, "v");
   EXPECT_EQ(std::filesystem::read_symlink(disk / "dst/sub/link"), "../file");
+  EXPECT_EQ(readFile(disk / "dst" + deep.substr(src.size()) + "/bottom"), "deep");
 
   // A dangling link travels as itself (following it would fail).
   EXPECT_TRUE(fm().moveItemAtURL(fileURL(shm / "dangling"), fileURL(disk / "dangling"), &err));
   EXPECT_TRUE(S_ISLNK(lstatOf(disk / "dangling").st_mode));
   EXPECT_FALSE(exists(shm / "dangling"));
+  // So does a socket, which cannot be opened to be flushed.
+  {
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    const std::string socketPath = shm / "socket";
+    ASSERT_LT(socketPath.size(), sizeof address.sun_path);
+    socketPath.copy(address.sun_path, socketPath.size());
+    sl::UniqueFd listening(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    ASSERT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+  }
+  EXPECT_TRUE(fm().moveItemAtURL(fileURL(shm / "socket"), fileURL(disk / "socket"), &err)) << err.description();
+  EXPECT_TRUE(S_ISSOCK(lstatOf(disk / "socket").st_mode));
   EXPECT_EQ(log.installer(), Lines{});
 
   // A source that cannot be removed afterwards stays and is logged: nobody
@@ -211,7 +230,7 @@ TEST_F(CrossVolume, MovesThatFailHalfwayKeepTheCopiedSource) {
        "rename of " + url(shm / "b") + " to " + url(shm / "to/b") + " is not durable: fsync of " + shm.path() + eio},
       // Across volumes: the copy is made but not flushed.
       {"EIO@1:sync", shm / "c", disk / "c", true, EIO, kMove,
-       "copy of " + url(shm / "c") + " to " + url(disk / "c") + " is not durable: fsync of " + disk / "c" + eio},
+       "copy of " + url(shm / "c") + " to " + url(disk / "c") + " is not durable: syncfs of " + disk / "c" + eio},
       // The fallback copy itself fails: its record is the move's.
       {"EXDEV@1:rename", shm / "d", shm / "missing/d", true, ENOENT, kCopy,
        "copyfile of " + url(shm / "d") + " to " + url(shm / "missing/d") + " failed: No such file or directory"},
