@@ -80,11 +80,12 @@ SLGlobalConfiguration::SLGlobalConfiguration() {
   }
 
   // Any number is taken as it is (consumers decide what a value below 1
-  // means); a value of another kind is ignored without a word.
+  // means), a boolean as 1 or 0; a value of another kind is ignored without
+  // a word.
   _nSimultaneousInstallations = kDefaultSimultaneousInstallations;
   value = sl::preferencesCopyValue(kSimultaneousInstallsNumberKey, kPreferencesDomain);
-  if (sl::Number number = value.asNumber(); !number.isNull()) {
-    _nSimultaneousInstallations = number.int32Value();
+  if (sl::Number number = value.asNumber(); !number.isNull() || value.kind() == sl::ValueKind::Boolean) {
+    _nSimultaneousInstallations = number.isNull() ? int32_t{value.asBoolean().boolValue()} : number.int32Value();
     SLLog(sl::kLogLevelNotice, kFunctionName, "Setting simultaneous installations allowed to %ld",
           static_cast<long>(_nSimultaneousInstallations));
   }
@@ -124,6 +125,7 @@ sl::String SLGlobalConfiguration::alternateThinningModelIdentifier() {
     case sl::ValueKind::String:
       return value.asString();
     case sl::ValueKind::Number:
+    case sl::ValueKind::Boolean:  // "1" or "0"
       return sl::String(value.description());
     default:
       return nullptr;

@@ -63,6 +63,10 @@ TEST(SettingsAndPaths, OnlyValuesOfTheRightKindChangeSettings) {
         notice("Skipping device family check because of a set default"),
         notice("Skipping device thinning check because of a set default"),
         notice("Setting simultaneous installations allowed to -2")}},
+      // A property-list boolean is a number: true is 1.
+      {{{"SimultaneousInstallsNumber", sl::Boolean(true)}},
+       {true, false, false, 1},
+       {notice("Setting simultaneous installations allowed to 1")}},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.prefs.description());
@@ -165,6 +169,7 @@ TEST(SettingsAndPaths, PersistedFlagAndThinningIdentifierReadOnEveryCall) {
   constexpr char kVariant[] = "ThinnedAppVariantID";
   const std::pair<sl::Dictionary, sl::String> thinningRows[] = {{{{kVariant, sl::String("model-7")}}, "model-7"},
                                                                {{{kVariant, sl::Number(42)}}, "42"},
+                                                               {{{kVariant, sl::Boolean(true)}}, "1"},
                                                                {{{kVariant, sl::Array{sl::Number(1)}}}, nullptr}};
   for (const auto& [stored, expected] : thinningRows) {
     root.writeDomain("com.vantor.jukorastored", stored);
