@@ -80,7 +80,10 @@ bool SLAppMigrator::_migrateContainerWithInfo(const sl::Dictionary& info) {
                   "SLAppMigrator: Failed to write out container marker dictionary... hopefully we don't need it to "
                   "recover.");
   };
-  if (!sl::writePropertyListToURL(info, container.URLByAppendingPathComponent(kMigrationMarkerName, false))) {
+  // Binary, which carries any bytes of a name; XML cannot carry a path that
+  // is not UTF-8, and a container without its marker cannot be resumed.
+  if (!sl::writePropertyListToURL(info, container.URLByAppendingPathComponent(kMigrationMarkerName, false),
+                                  sl::PropertyListFormat::Binary)) {
     markerFailed();
   }
 

@@ -113,7 +113,8 @@ bool SLAppMigrator::_stageAndInstallPlaceholderForBundleAtURL(const sl::URL& bun
     }
 
     const sl::URL infoURL = placeholder.URLByAppendingPathComponent(sl::kBundleInfoPlistName, false);
-    if (!sl::writePropertyListToURL(placeholderInfo, infoURL)) {
+    // Binary, which carries whatever the bundle's own Info.plist held.
+    if (!sl::writePropertyListToURL(placeholderInfo, infoURL, sl::PropertyListFormat::Binary)) {
       SLMigratorLog(sl::kLogLevelError, kPlaceholderFunctionName,
                     "SLAppMigrator: Failed to write placeholder Info.plist to %@", infoURL);
       return false;

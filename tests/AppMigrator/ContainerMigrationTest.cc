@@ -51,7 +51,8 @@ class ContainerMigrationTest : public MigratorTest {
 
 TEST_F(ContainerMigrationTest, FailuresBeforeTheDataMovesKeepTheContainerWithItsMarker) {
   // A VPN plug-in never gets a placeholder; unknown to the registry, it fails.
-  sl::Dictionary vpn = makeContainer("V", "com.example.vpn");
+  // Its marker keeps the bytes of a name that is not UTF-8.
+  sl::Dictionary vpn = makeContainer("V\xff", "com.example.vpn");
   vpn.set("ContainerType", sl::String("VPNBundle"));
   EXPECT_FALSE(migrate(vpn));
   EXPECT_EQ(sl::dictionaryWithContentsOfURL(fileURL(path(vpn, "ContainerPath") + "/" + kMarker)), vpn);
