@@ -8,6 +8,8 @@
 // Nothing is undone on failure: whatever was moved stays in the staging
 // directory, which goes away with the old container.
 
+#include <sys/stat.h>
+
 #include <cstdint>
 
 #include "AppMigrator/OldLayout.h"
@@ -23,6 +25,19 @@ using sl::migrator::kStagingDirectoryName;
 using sl::migrator::kPayloadDirectoryName;
 constexpr uint64_t kMigratorInstallType = 6;
 
+// The staging directory and its Payload are this system's own names in the
+// old container. Anything else standing at one of them (a link planted to
+// lead the package's moves out of the container, a file) would go with the
+// container anyway: it goes now, so that the package is built in a
+// directory of the container itself.
+void removeIfNotADirectory(const sl::URL& url) {
+  struct stat st;
+  if (::lstat(url.fileSystemRepresentation(), &st) != 0 || S_ISDIR(st.st_mode)) return;
+  SLMigratorLog(sl::kLogLevelError, kFunctionName, "SLAppMigrator: Removing %@ before staging: it is not a directory",
+                url);
+  (void)SLFileManager::defaultManager().removeItemAtURL(url);
+}
+
 }  // namespace
 
 bool SLAppMigrator::_stageAndInstallBundleAtURL(const sl::URL& bundle, const sl::String& withIdentifier,
@@ -31,6 +46,8 @@ bool SLAppMigrator::_stageAndInstallBundleAtURL(const sl::URL& bundle, const sl:
   const sl::URL staging = inContainerURL.URLByAppendingPathComponent(kStagingDirectoryName, true);
   const sl::URL payload = staging.URLByAppendingPathComponent(kPayloadDirectoryName, true);
 
+  removeIfNotADirectory(staging);
+  removeIfNotADirectory(payload);
   sl::Error error;
   if (!fm.createDirectoryAtURL(payload, true, 0755, &error)) {
     SLMigratorLog(sl::kLogLevelError, kFunctionName, "SLAppMigrator: Failed to create %@ : %@", payload, error);

@@ -4,7 +4,8 @@
 //
 // The placeholder is built in TMP/com.vantor.stowline.migrator/<id>.app and
 // that directory is removed at the end of every call, whatever happened;
-// the parent stays.
+// the parent stays. TMP is shared: the parent must be a private directory
+// of this user, so that nobody else can plant or swap anything in it.
 
 #include <cerrno>
 #include <cstdint>
@@ -53,15 +54,21 @@ bool SLAppMigrator::_stageAndInstallPlaceholderForBundleAtURL(const sl::URL& bun
 
   // An identifier holding a separator (or none at all) would put the
   // directory, and its removal at the end, somewhere else than below the
-  // staging parent: it is refused as a creation failure, and nothing is
-  // removed.
-  if (withIdentifier.length() == 0 || withIdentifier.view().find('/') != std::string_view::npos) {
-    const sl::Error error =
-        sl::Error::posix(EINVAL, sl::format("%@ is not usable as a placeholder directory name", withIdentifier));
+  // staging parent; a staging parent that is not this user's own would let
+  // that removal reach through whatever stands there. Either is refused as
+  // a creation failure, and nothing is removed.
+  sl::Error refusal;
+  const bool usableName = withIdentifier.length() != 0 && withIdentifier.view().find('/') == std::string_view::npos;
+  if (!usableName) {
+    refusal = sl::Error::posix(EINVAL, sl::format("%@ is not usable as a placeholder directory name", withIdentifier));
+  }
+  if (!usableName || sl::privateTemporarySubdirectory(kStagingParentName, &refusal).isNull()) {
     SLMigratorLog(sl::kLogLevelError, kPlaceholderFunctionName,
-                  "SLAppMigrator: Failed to create staged placeholder directory at %@ : %@", placeholder, error);
+                  "SLAppMigrator: Failed to create staged placeholder directory at %@ : %@", placeholder, refusal);
     return false;
   }
+  // What a run that stopped half-way left is not built upon.
+  if (fm.itemExistsAtURL(placeholder)) (void)fm.removeItemAtURL(placeholder);
 
   const bool result = [&]() -> bool {
     // The placeholder is scratch until the registry has installed it, and

@@ -1,6 +1,9 @@
 // The per-process temporary directory.
 #pragma once
 
+#include <string_view>
+
+#include "Platform/Error.h"
 #include "Platform/URL.h"
 
 namespace sl {
@@ -17,5 +20,15 @@ namespace sl {
 // could not be made: whoever then creates something in it meets the
 // failure with an error record of its own.
 URL perProcessTemporaryDirectory();
+
+// The directory `name` in the temporary directory above, made when missing
+// (mode 0700), for scratch work that nobody else may reach: it must be a
+// real directory (not a link) owned by the effective user, and it is made
+// unwritable by group and others when it was not. Anything else standing
+// there (another user's directory or link, made ahead of us in a shared
+// directory) is refused with a POSIX record: EEXIST "<path> is not a
+// private directory of this user", or "<step> of <path> failed: <strerror>".
+// The name must be a single path component.
+URL privateTemporarySubdirectory(std::string_view name, Error* error = nullptr);
 
 }  // namespace sl

@@ -105,6 +105,17 @@ TEST_F(HostileContainerTest, HostileItemsInAContainer) {
          ASSERT_EQ(mkfifo((c + "/A.app/Info.plist").c_str(), 0600), 0);
        },
        true, "SLAppMigrator: Could not get identifier for bundle at " + u(c + "/A.app", true)},
+      // The package is built in the container's own staging directory: a
+      // link at its name, or at its Payload's, is removed first.
+      {"staging directory that is a link to the sentinel",
+       [&] {
+         makeSymlink(sentinel.path(), c + "/Staging");
+         writeFile(c + "/Manifest.plist", "store data");
+       },
+       true, "SLAppMigrator: Removing " + u(c + "/Staging", true) + " before staging: it is not a directory"},
+      {"payload directory that is a link to the sentinel",
+       [&] { makeSymlink(sentinel / "nested", c + "/Staging/Payload"); }, true,
+       "SLAppMigrator: Removing " + u(c + "/Staging/Payload", true) + " before staging: it is not a directory"},
       {"odd names and a path past 4096 bytes in the data",
        [&] {
          writeFile(c + "/Documents/new\nline", "x");

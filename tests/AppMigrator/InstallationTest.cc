@@ -220,6 +220,42 @@ TEST_F(InstallationTest, InstallsPlaceholders) {
   EXPECT_TRUE(exists(outside));
   sl::test::forceRemove(sl::perProcessTemporaryDirectory().path() + "/outside.app");
 
+  // The staging parent lies in a shared directory. One that is not this
+  // user's own (a link, another user's directory) is refused before
+  // anything is made or removed through it.
+  const std::string parent = staged.substr(0, staged.rfind('/'));
+  const std::string elsewhere = c_ + "/elsewhere";
+  sl::test::writeFile(elsewhere + "/com.ex.p.app/kept");
+  sl::test::forceRemove(parent);
+  sl::test::makeSymlink(elsewhere, parent);
+  for (const bool link : {true, false}) {
+    SCOPED_TRACE(link ? "link" : "another user's directory");
+    if (!link) {
+      sl::test::forceRemove(parent);
+      sl::test::makeDirs(parent + "/com.ex.p.app");
+      ASSERT_EQ(chown(parent.c_str(), sl::test::ScopedUnprivileged::kUid, sl::test::ScopedUnprivileged::kGid), 0);
+    }
+    log_.clear();
+    EXPECT_FALSE(install());
+    const std::string why = parent + " is not a private directory of this user";
+    EXPECT_EQ(lines(), (std::vector{line(3, kPlaceholder,
+                                         "Failed to create staged placeholder directory at " + url(staged) +
+                                             " : Error Domain=POSIXErrorDomain Code=17 \"" + why +
+                                             "\" UserInfo={LocalizedDescription=" + why + "}")}));
+    EXPECT_TRUE(exists(link ? elsewhere + "/com.ex.p.app/kept" : staged));
+  }
+  // Our own, left open to others and holding what a stopped run left: it
+  // is closed, and the placeholder is built afresh.
+  fresh();
+  makePlaceholderSource(bundle, true);
+  sl::test::writeFile(staged + "/stale");
+  ASSERT_EQ(chmod(parent.c_str(), 0777), 0);
+  ASSERT_TRUE(install());
+  struct stat parentStat {};
+  ASSERT_EQ(lstat(parent.c_str(), &parentStat), 0);
+  EXPECT_EQ(parentStat.st_mode & 07777, 0755u);
+  EXPECT_FALSE(exists(RGBundleProxy::bundleProxyForIdentifier("com.ex.p")->bundleURL().path() + "/stale"));
+
   // A bundle that is not there.
   sl::test::forceRemove(bundle);
   log_.clear();
