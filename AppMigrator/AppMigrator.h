@@ -50,6 +50,9 @@ class SLAppMigrator final : public DataClassMigrator {
   // when the instance must not be handed out.
   bool init();
 
+  // The passes of performMigration, which keeps any exception from the host.
+  bool runPasses();
+
   // Introspection and the marker.
   sl::Dictionary _introspectContainer(const sl::URL& url, bool* orderResultEarly);
   sl::String _bundleIdentifierForBundle(const sl::URL& bundle);

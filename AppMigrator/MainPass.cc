@@ -2,7 +2,10 @@
 
 #include <cerrno>
 #include <deque>
+#include <exception>
+#include <map>
 #include <optional>
+#include <string>
 #include <vector>
 
 #include "AppMigrator/OldLayout.h"
@@ -21,6 +24,19 @@ constexpr const char* kVersionFileName = sl::migrator::kLastSystemVersionFileNam
 }  // namespace
 
 bool SLAppMigrator::performMigration() {
+  // An exception that escapes the passes (an allocation failure) ends the
+  // migration with false instead of crossing into the host; what was done
+  // is then as durable as after a kill, and the next run resumes it.
+  try {
+    return runPasses();
+  } catch (const std::exception& e) {
+    SLMigratorLog(sl::kLogLevelError, "-[SLAppMigrator performMigration]", "SLAppMigrator: Migration stopped: %s",
+                  e.what());
+    return false;
+  }
+}
+
+bool SLAppMigrator::runPasses() {
   static constexpr char kFunctionName[] = "-[SLAppMigrator performMigration]";
   static constexpr char kReturningFailed[] =
       "SLAppMigrator: Returning migration failed. Please include the contents of /var/mobile/Library/Logs/Stowline "
@@ -58,6 +74,27 @@ bool SLAppMigrator::performMigration() {
         records.push_back(std::move(record));
       }
     }
+
+    // Two containers that claim one identifier would both move their data
+    // into that application's one data container, the later replacing what
+    // the earlier moved. Which of them holds the application cannot be
+    // told, so neither is migrated: both stay for the final check.
+    std::map<std::string, std::vector<std::string>> claims;  // identifier -> containers
+    for (const sl::Dictionary& record : records) {
+      claims[record.get(sl::migrator::kBundleIdentifierKey).asString().str()].push_back(
+          record.get(sl::migrator::kContainerPathKey).asString().str());
+    }
+    std::erase_if(records, [&](const sl::Dictionary& record) {
+      const sl::String identifier = record.get(sl::migrator::kBundleIdentifierKey).asString();
+      const std::vector<std::string>& containers = claims[identifier.str()];
+      if (containers.size() < 2) return false;
+      SLMigratorLog(sl::kLogLevelError, kFunctionName,
+                    "SLAppMigrator: Leaving %@ in place: %lu containers claim the identifier %@",
+                    record.get(sl::migrator::kContainerPathKey), static_cast<unsigned long>(containers.size()),
+                    identifier);
+      countItem();
+      return true;
+    });
 
     // Migration: each record counts once, whatever its outcome.
     for (const sl::Dictionary& record : records) {

@@ -52,13 +52,14 @@ bool SLAppMigrator::_stageAndInstallPlaceholderForBundleAtURL(const sl::URL& bun
                                   .URLByAppendingPathComponent(withIdentifier.view(), true)
                                   .URLByAppendingPathExtension("app");
 
-  // An identifier holding a separator (or none at all) would put the
+  // An identifier holding a separator or a NUL (or none at all) would put the
   // directory, and its removal at the end, somewhere else than below the
   // staging parent; a staging parent that is not this user's own would let
   // that removal reach through whatever stands there. Either is refused as
   // a creation failure, and nothing is removed.
   sl::Error refusal;
-  const bool usableName = withIdentifier.length() != 0 && withIdentifier.view().find('/') == std::string_view::npos;
+  const bool usableName = withIdentifier.length() != 0 &&
+                          withIdentifier.view().find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
   if (!usableName) {
     refusal = sl::Error::posix(EINVAL, sl::format("%@ is not usable as a placeholder directory name", withIdentifier));
   }

@@ -138,17 +138,25 @@ bool readFileContents(const URL& url, std::vector<uint8_t>* out, Error* error) {
   if (!S_ISREG(st.st_mode)) {
     return plist_detail::fail(error, EINVAL, format("read of %s failed: not a regular file", path));
   }
+  // Nothing read whole here comes near the limit (property lists, store
+  // metadata, os-release); a file past it (a sparse one of any claimed size)
+  // is refused rather than exhaust memory.
+  const auto tooLarge = [&] {
+    return plist_detail::fail(error, EFBIG, format("read of %s failed: %s", path, errnoText(EFBIG)));
+  };
+  if (st.st_size > static_cast<off_t>(kLargestFileRead)) return tooLarge();
   std::vector<uint8_t> bytes;
   // The size is a hint only: files of /proc and the like report 0, and a
   // file may grow or shrink while it is read. Read until end of file.
   // One byte more than the size lets the read that sees end of file land in
-  // the buffer without growing it. (The hint is capped: a sparse file may
-  // claim far more than it will ever deliver or than memory holds.)
-  constexpr off_t kLargestHint = off_t{1} << 28;
-  if (S_ISREG(st.st_mode) && st.st_size > 0) bytes.resize(static_cast<size_t>(std::min(st.st_size, kLargestHint)) + 1);
+  // the buffer without growing it.
+  if (st.st_size > 0) bytes.resize(static_cast<size_t>(st.st_size) + 1);
   size_t used = 0;
   for (;;) {
-    if (used == bytes.size()) bytes.resize(bytes.size() + std::max<size_t>(65536, bytes.size() / 2));
+    if (used == bytes.size()) {
+      if (used > kLargestFileRead) return tooLarge();
+      bytes.resize(bytes.size() + std::max<size_t>(65536, bytes.size() / 2));
+    }
     ssize_t n = ::read(fd.get(), bytes.data() + used, bytes.size() - used);
     if (n < 0) {
       int e = errno;

@@ -58,8 +58,10 @@ Value propertyListFromData(std::span<const uint8_t> bytes, Error* error = nullpt
 bool dataFromPropertyList(const Value& value, PropertyListFormat format, std::vector<uint8_t>* out,
                           Error* error = nullptr);
 
-// Reads the whole file at url. Returns the bytes, or false with a POSIX
-// record (errno of open, fstat or read).
+// Reads the whole file at url, a regular file of at most kLargestFileRead
+// bytes. Returns the bytes, or false with a POSIX record (errno of open,
+// fstat or read; EFBIG for a larger file).
+inline constexpr size_t kLargestFileRead = size_t{64} << 20;
 bool readFileContents(const URL& url, std::vector<uint8_t>* out, Error* error = nullptr);
 
 // The dictionary stored in the property-list file at url; null when the

@@ -20,10 +20,14 @@ std::string normalisedPath(std::string_view path) {
   return out;
 }
 
+// A path is handed to the system as a C string: a NUL byte would end it
+// early, so that it named another file (a directory above the one meant).
+bool holdsNul(std::string_view s) { return s.find('\0') != std::string_view::npos; }
+
 }  // namespace
 
 URL URL::fileURLWithPath(std::string_view path, bool isDirectory) {
-  if (path.empty()) return URL();
+  if (path.empty() || holdsNul(path)) return URL();
   return URL(std::make_shared<URLNode>(normalisedPath(path), isDirectory));
 }
 
@@ -56,7 +60,7 @@ std::string URL::pathExtension() const {
 }
 
 URL URL::URLByAppendingPathComponent(std::string_view component, bool isDirectory) const {
-  if (isNull()) return URL();
+  if (isNull() || holdsNul(component)) return URL();
   const std::string& base = path();
   std::string p;
   p.reserve(base.size() + 1 + component.size());
@@ -70,7 +74,7 @@ URL URL::URLByAppendingPathComponent(std::string_view component, bool isDirector
 }
 
 URL URL::URLByAppendingPathExtension(std::string_view extension) const {
-  if (isNull()) return URL();
+  if (isNull() || holdsNul(extension)) return URL();
   std::string p = path();
   p += '.';
   p += extension;

@@ -22,7 +22,9 @@ class URL : public Value {
   URL() = default;
   URL(std::nullptr_t) {}  // NOLINT
 
-  // A file URL for the path given as bytes. An empty path gives a null URL.
+  // A file URL for the path given as bytes. An empty path gives a null URL,
+  // and so does one holding a NUL byte (the system would read it as a
+  // shorter path); appending a component or extension that holds one too.
   static URL fileURLWithPath(std::string_view path, bool isDirectory);
   static URL fileURLWithFileSystemRepresentation(const char* bytes, bool isDirectory) {
     return fileURLWithPath(bytes ? std::string_view(bytes) : std::string_view(), isDirectory);

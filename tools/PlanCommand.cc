@@ -482,6 +482,18 @@ int planCommand(Arguments args) {
     }
     if (items.empty()) rootState = "empty";
   }
+  // Containers that claim one identifier stay, as the migration leaves them.
+  std::map<std::string, size_t> claims;
+  for (const Item& item : items) {
+    if (!item.record.isNull()) ++claims[stringOf(item.record, mg::kBundleIdentifierKey)];
+  }
+  for (Item& item : items) {
+    if (item.record.isNull()) continue;
+    const std::string identifier = stringOf(item.record, mg::kBundleIdentifierKey);
+    if (claims[identifier] > 1) {
+      item.stays = std::to_string(claims[identifier]) + " containers claim the identifier " + identifier;
+    }
+  }
   bool harborMapPresent = false, harborMapReadable = false;
   const sl::URL harborMapURL =
       configuration.dataDirectoryPath().URLByAppendingPathComponent(kSafeHarborFileName, false);

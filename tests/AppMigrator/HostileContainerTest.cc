@@ -88,13 +88,28 @@ TEST_F(HostileContainerTest, HostileItemsInAContainer) {
       // the plug-in.)
       {"forged marker naming another container of the root",
        [&] {
-         makeBundle(oldEntry("D") + "/B.app", "com.forged");
+         makeBundle(oldEntry("D") + "/B.app", "com.d");
          writePlist(c + "/" + kMarker, record(oldEntry("D"), oldEntry("D") + "/B.app"));
        },
        false,
        "SLAppMigrator: Not removing " + u(below(kInstallMap)) + " because 1 items remain unmigrated."},
+      // Two containers claiming one identifier would pour their data into
+      // one data container, the later over the earlier: neither moves.
+      {"another container claiming the same identifier",
+       [&] {
+         makeBundle(oldEntry("D") + "/B.app", "com.a");
+         writeFile(oldEntry("D") + "/Documents/doc.txt", "the other doc");
+       },
+       false,
+       "SLAppMigrator: Leaving " + oldEntry("D") + " in place: 2 containers claim the identifier com.a"},
       {"marker that is a fifo", [&] { ASSERT_EQ(mkfifo((c + "/" + kMarker).c_str(), 0600), 0); }, false,
        "SLAppMigrator: Failed to load migration marker file from " + u(c + "/" + kMarker)},
+      {"sparse marker claiming 64 GiB",
+       [&] {
+         writeFile(c + "/" + kMarker, "");
+         ASSERT_EQ(truncate((c + "/" + kMarker).c_str(), off_t{64} << 30), 0);
+       },
+       false, "SLAppMigrator: Failed to load migration marker file from " + u(c + "/" + kMarker)},
       {"marker that is a directory", [&] { makeDirs(c + "/" + kMarker); }, false,
        "SLAppMigrator: Failed to load migration marker file from " + u(c + "/" + kMarker, true)},
       {"marker that is a link to the sentinel", [&] { makeSymlink(sentinel / "secret.txt", c + "/" + kMarker); },

@@ -255,6 +255,13 @@ TEST_F(InstallationTest, InstallsPlaceholders) {
   ASSERT_EQ(lstat(parent.c_str(), &parentStat), 0);
   EXPECT_EQ(parentStat.st_mode & 07777, 0755u);
   EXPECT_FALSE(exists(RGBundleProxy::bundleProxyForIdentifier("com.ex.p")->bundleURL().path() + "/stale"));
+  // An identifier with a NUL byte would name the staging parent itself
+  // where the system reads the path: refused, and the parent stays.
+  log_.clear();
+  EXPECT_FALSE(Access::installPlaceholder(*migrator_, fileURL(bundle, true), sl::String(std::string_view("\0", 1)),
+                                          fileURL(c_, true)));
+  EXPECT_EQ(lines().size(), 1u);
+  EXPECT_TRUE(exists(parent));
 
   // A bundle that is not there.
   sl::test::forceRemove(bundle);
@@ -340,8 +347,12 @@ TEST_F(InstallationTest, MigratesGroupContainers) {
 TEST(FileDataTest, ReadFailuresCarryTheFileDomain) {
   sl::test::TempDir dir;
   sl::test::writeFile(dir / "secret", "x", 0600);
+  // A sparse file claiming more than memory holds is refused, not read.
+  sl::test::writeFile(dir / "huge", "", 0644);
+  ASSERT_EQ(truncate((dir / "huge").c_str(), off_t{64} << 30), 0);
   sl::test::ScopedUnprivileged nobody;
-  for (const auto& [name, code, posix] : {std::tuple("missing", 260, ENOENT), std::tuple("secret", 257, EACCES)}) {
+  for (const auto& [name, code, posix] :
+       {std::tuple("missing", 260, ENOENT), std::tuple("secret", 257, EACCES), std::tuple("huge", 256, EFBIG)}) {
     sl::Error error;
     EXPECT_TRUE(sl::dataWithContentsOfURL(fileURL(dir / name), &error).isNull());
     EXPECT_EQ(error.domain() + std::to_string(error.code()), "FileErrorDomain" + std::to_string(code));

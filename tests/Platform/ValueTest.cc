@@ -133,6 +133,11 @@ TEST(ValueTest, FileURLs) {
   EXPECT_EQ(URL::fileURLWithPath("/", true).absoluteString(), "file:///");
   EXPECT_EQ(URL::fileURLWithPath("/", true).URLByAppendingPathComponent("tmp", true).path(), "/tmp");
   EXPECT_TRUE(URL::fileURLWithPath("", false).isNull());
+  // A NUL byte would cut the path short where the system reads it.
+  using namespace std::string_view_literals;
+  EXPECT_TRUE(URL::fileURLWithPath("/tmp/a\0/b"sv, false).isNull());
+  EXPECT_TRUE(dir.URLByAppendingPathComponent("\0.app"sv, true).isNull());
+  EXPECT_TRUE(dir.URLByAppendingPathExtension("app\0"sv).isNull());
 
   // Names that are not UTF-8 keep their bytes.
   std::string odd = "/tmp/caf\xe9\xff";

@@ -22,9 +22,9 @@ using sl::test::TempDir;
 
 const std::string kOldRoot = "/private/var/mobile/Applications";
 
-void makeApp(const std::string& app) {
+void makeApp(const std::string& app, const char* identifier = "com.example.a") {
   sl::test::makeDirs(app);
-  ASSERT_TRUE(sl::writePropertyListToURL(sl::Dictionary{{"PBBundleIdentifier", sl::String("com.example.a")},
+  ASSERT_TRUE(sl::writePropertyListToURL(sl::Dictionary{{"PBBundleIdentifier", sl::String(identifier)},
                                                         {"PBBundleVersion", sl::String("1.0")},
                                                         {"PBBundleExecutable", sl::String("Exec")}},
                                          sl::test::fileURL(app + "/Info.plist")));
@@ -191,7 +191,7 @@ TEST(MigrateTest, ForgedMarkersAreRefusedBeforeAnythingChanges) {
     TempDir root(TempDir::kShm);
     makeOldLayout(root.path());
     const std::string old = root.path() + kOldRoot;
-    makeApp(old + "/D/B.app");
+    makeApp(old + "/D/B.app", "com.example.d");
     sl::test::makeSymlink(sentinel.path(), old + "/L");
     const auto resolve = [&](std::string path) {
       if (path.starts_with("$")) path.replace(0, 2, path[1] == 'S' ? sentinel.path() : old);

@@ -56,6 +56,9 @@ TEST_F(PlanTest, ChangesNothingAndAgreesWithMigrate) {
   mgtest::makeBundle(mgtest::below("/Real.app"), "com.plan.l");
   sl::test::makeDirs(entry("Linked"));
   sl::test::makeSymlink(mgtest::below("/Real.app"), entry("Linked/L.app"));
+  // Two containers claiming one identifier: both stay.
+  mgtest::makeBundle(entry("Twin1/T.app"), "com.plan.t");
+  mgtest::makeBundle(entry("Twin2/T.app"), "com.plan.t");
 
   // The registry stays open: what it recorded is still in its write-ahead
   // log, which plan must read without touching it.
@@ -71,6 +74,7 @@ TEST_F(PlanTest, ChangesNothingAndAgreesWithMigrate) {
   const std::pair<std::string, std::string> expected[] = {
       {"App", "recordBuilt"},  {"VPN", "recordBuilt"}, {"Marked", "markerFound"},
       {"stray.txt", "delete"}, {"Empty", "delete"},    {"Linked", "leaveInPlace"},
+      {"Twin1", "recordBuilt"}, {"Twin2", "recordBuilt"},
   };
   for (const auto& [name, classification] : expected)
     EXPECT_TRUE(hasItem(json.out, entry(name), classification)) << name;
@@ -81,7 +85,8 @@ TEST_F(PlanTest, ChangesNothingAndAgreesWithMigrate) {
            "\"dataItems\":[\"" + entry("App/Documents") + "\",\"" + entry("App/Library") + "\"]",
            "\"groupContainers\":[{\"group\":\"group.plan\",\"path\":\"" + mgtest::below("/oldgroup") +
                "\",\"exists\":true}],\"leftovers\":[]",
-           "\"staysBecause\":\"the registry does not know it and only applications get a placeholder\""}) {
+           "\"staysBecause\":\"the registry does not know it and only applications get a placeholder\"",
+           "\"staysBecause\":\"2 containers claim the identifier com.plan.t\""}) {
     EXPECT_NE(json.out.find(fact), std::string::npos) << fact << "\n" << json.out;
   }
 
@@ -97,6 +102,7 @@ TEST_F(PlanTest, ChangesNothingAndAgreesWithMigrate) {
     EXPECT_EQ(after, exists(entry(name)) ? "stays" : "gone") << name;
   }
   EXPECT_TRUE(exists(entry("VPN")));
+  EXPECT_TRUE(exists(entry("Twin1/T.app")) && exists(entry("Twin2/T.app")));
   EXPECT_FALSE(exists(mgtest::below("/oldgroup")));
 }
 
