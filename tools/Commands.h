@@ -34,9 +34,10 @@ int usageError(std::string_view command, std::string_view message);
 // exist, a plug-in that cannot be loaded, a log file that cannot be opened).
 int setupError(std::string_view command, std::string_view message);
 
-// Sets the system root from --root (already checked to be an existing
-// directory) before anything reads the configuration. Returns false with a
-// usage error printed when it is not a directory.
+// Sets the system root from --root before anything reads the
+// configuration. The root in effect (--root, else STOWLINE_ROOT, else "/")
+// must be an existing directory; otherwise a setup error is printed and the
+// answer is false.
 bool applyRoot(std::string_view command, const std::string& root);
 
 // A migration marker of the old layout whose paths lie outside it. The

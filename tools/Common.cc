@@ -22,17 +22,19 @@ int setupError(std::string_view command, std::string_view message) {
 }
 
 bool applyRoot(std::string_view command, const std::string& root) {
-  if (root.empty()) return true;  // STOWLINE_ROOT or "/"
+  // Without --root, STOWLINE_ROOT or "/": checked all the same, so that
+  // nothing is made below a root that is not there.
+  const std::string effective = root.empty() ? sl::systemRoot() : root;
   struct stat st;
-  if (::stat(root.c_str(), &st) != 0) {
-    setupError(command, "root " + root + " does not exist");
+  if (::stat(effective.c_str(), &st) != 0) {
+    setupError(command, "root " + effective + " does not exist");
     return false;
   }
   if (!S_ISDIR(st.st_mode)) {
-    setupError(command, "root " + root + " is not a directory");
+    setupError(command, "root " + effective + " is not a directory");
     return false;
   }
-  sl::setSystemRoot(root);
+  if (!root.empty()) sl::setSystemRoot(root);
   return true;
 }
 

@@ -219,11 +219,23 @@ class LogWriter {
 
  private:
   // The text layout, with or without the time in front, or one JSON object.
+  // A text record is one line whatever its message holds: a line break in a
+  // name is written as "\n" (or "\r"), so no name can forge a line.
   static std::string format(const sl::LogRecord& record, bool jsonl, bool withTime) {
     if (!jsonl) {
       std::string line = withTime ? isoTime() + " " : std::string();
       line.append(sl::logLevelName(record.level)).append(" ").append(record.category);
-      line.append(" ").append(record.function).append(": ").append(record.message).append("\n");
+      line.append(" ").append(record.function).append(": ");
+      for (const char c : record.message) {
+        if (c == '\n') {
+          line.append("\\n");
+        } else if (c == '\r') {
+          line.append("\\r");
+        } else {
+          line.push_back(c);
+        }
+      }
+      line.append("\n");
       return line;
     }
     JsonWriter json;
@@ -443,9 +455,6 @@ int migrateCommand(Arguments args) {
   // 1. The root: it must be a directory (also when it comes from
   //    STOWLINE_ROOT or is "/").
   if (!applyRoot(kCommand, options.root)) return 2;
-  struct stat rootStatus;
-  if (::stat(sl::systemRoot().c_str(), &rootStatus) != 0 || !S_ISDIR(rootStatus.st_mode))
-    return setupError(kCommand, "root " + sl::systemRoot() + " is not a directory");
 
   // 2. The migration markers. The plug-in acts on a marker's paths as they
   //    stand; one that leads outside the old layout stops the run here,

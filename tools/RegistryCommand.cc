@@ -40,7 +40,9 @@ constexpr char kUsage[] =
     "  show ID           one application; exit status 1 when the registry does not know it\n"
     "  install PATH      install a customer package (a directory holding Payload/NAME.app);\n"
     "                    with --placeholder, PATH is a bundle directory installed as a\n"
-    "                    placeholder. The package is consumed whatever the outcome.\n"
+    "                    placeholder. Once the registry has it, the package is consumed\n"
+    "                    whatever the outcome; one refused before (no application in\n"
+    "                    Payload, no identifier) stays where it is.\n"
     "  harbors           the recorded safe harbors\n"
     "\n"
     "  --root DIR        the system root (default: STOWLINE_ROOT, else /)\n"
@@ -289,8 +291,7 @@ int registryCommand(Arguments args) {
   const std::shared_ptr<EmbeddedRegistry> registry =
       EmbeddedRegistry::open(SLGlobalConfiguration::sharedInstance(), &error);
   if (!registry) {
-    std::fprintf(stderr, "stowline registry: cannot open the registry: %s\n", describe(error).c_str());
-    return 1;
+    return setupError(kCommand, "cannot open the registry: " + describe(error));
   }
   if (action == "list") return listApplications(*registry, asJson);
   if (action == "show") return showApplication(*registry, words[1], asJson);

@@ -14,6 +14,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <filesystem>
 #include <map>
 #include <string>
 #include <vector>
@@ -268,7 +269,9 @@ int verifyCommand(Arguments args) {
   if (json) {
     JsonWriter w;
     w.beginObject();
-    w.key("manifest").string(manifestPath);
+    std::error_code cwdError;  // the path as given, when the working directory is gone
+    const std::filesystem::path absolute = std::filesystem::absolute(manifestPath, cwdError);
+    w.key("manifest").string(cwdError ? manifestPath : absolute.lexically_normal().string());
     w.key("checked").number(static_cast<uint64_t>(checker.checked()));
     w.key("ok").boolean(problems.empty());
     w.key("problems").beginArray();

@@ -74,7 +74,8 @@ TEST(MigrateTest, SummaryLogsAndExitStatus) {
     SCOPED_TRACE("a link in the old container root: failure, text log, errors on stderr too");
     TempDir root(TempDir::kShm);
     makeOldLayout(root.path());
-    sl::test::makeSymlink("/nonexistent", root.path() + kOldRoot + "/link");
+    // Its name holds a line break: the text log keeps one line per record.
+    sl::test::makeSymlink("/nonexistent", root.path() + kOldRoot + "/link\nforged: line");
     const std::string log = root / "migrate.log";
     const ProgramResult r = stowline({"migrate", "--root", root.path(), "--json", "--log-file", log});
     EXPECT_EQ(r.status, 1) << r.err;
@@ -83,6 +84,8 @@ TEST(MigrateTest, SummaryLogsAndExitStatus) {
     const std::string text = sl::test::readFile(log);
     EXPECT_TRUE(hasLine(text, std::regex(R"(\S+Z notice Movanta -\[SLAppMigrator init\]: )"
                                          R"(SLAppMigrator: 1 items to migrate)")));
+    EXPECT_TRUE(hasLine(text, std::regex(R"(.* Ignoring symlink at .*/link\\nforged: line)"))) << text;
+    EXPECT_FALSE(hasLine(text, std::regex("forged: line"))) << text;
     EXPECT_TRUE(hasLine(text, std::regex(R"(\S+Z error Movanta -\[SLAppMigrator performMigration\]: )"
                                          R"(SLAppMigrator: Not removing .* because 1 items remain unmigrated\.)")));
     EXPECT_TRUE(hasLine(r.err, std::regex(R"(error Movanta -\[SLAppMigrator performMigration\]: )"
@@ -136,6 +139,24 @@ TEST(MigrateTest, UsageErrorsChangeNothing) {
     EXPECT_TRUE(!c.oneLine || lineCount(r.err) == 1u) << r.err;
     EXPECT_EQ(sl::test::listTree(root.path()), before);
   }
+
+  // The root may come from STOWLINE_ROOT: one that is not there is refused
+  // by every command that reads the layout, and nothing is made below it.
+  for (const char* command : {"migrate", "plan", "config", "registry"}) {
+    SCOPED_TRACE(command);
+    std::vector<std::string> args{SL_STOWLINE_PATH, command};
+    if (std::string(command) == "registry") args.push_back("list");
+    const ProgramResult r = sl::test::runProgram(args, {"STOWLINE_ROOT=" + (root / "missing")});
+    EXPECT_EQ(r.status, 2);
+    EXPECT_EQ(r.err, "stowline " + std::string(command) + ": root " + (root / "missing") + " does not exist\n");
+    EXPECT_FALSE(sl::test::exists(root / "missing"));
+  }
+  // A registry that cannot be opened is the user's to fix: status 2.
+  TempDir other(TempDir::kShm);
+  sl::test::writeFile(other.path() + "/private/var/stowd/Library/Registry", "not a directory");
+  const ProgramResult r = stowline({"registry", "--root", other.path(), "list"});
+  EXPECT_EQ(r.status, 2);
+  EXPECT_TRUE(r.err.starts_with("stowline registry: cannot open the registry: ")) << r.err;
 }
 
 TEST(MigrateTest, DigestAndConfig) {
