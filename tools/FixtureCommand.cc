@@ -305,7 +305,10 @@ bool FixtureWriter::writeRandomFile(const Directory& parent, const std::string& 
 bool FixtureWriter::writePropertyList(const Directory& parent, const std::string& name, const sl::Value& value) {
   std::vector<uint8_t> bytes;
   sl::Error error;
-  if (!sl::dataFromPropertyList(value, sl::PropertyListFormat::XML, &bytes, &error)) {
+  // XML where it can carry the value; a path below a root whose name is not
+  // UTF-8 needs the binary form.
+  if (!sl::dataFromPropertyList(value, sl::PropertyListFormat::XML, &bytes) &&
+      !sl::dataFromPropertyList(value, sl::PropertyListFormat::Binary, &bytes, &error)) {
     std::fprintf(stderr, "stowline fixture: cannot encode %s/%s: %s\n", parent.path.c_str(), name.c_str(),
                  error.description().c_str());
     return false;

@@ -66,6 +66,17 @@ TEST(FixtureTest, SameSeedGivesTheSameTreeAndOtherSeedsDiffer) {
   for (const auto& [group, record] : groups) {
     EXPECT_TRUE(first.at(relative(record.asDictionary().get("Container"))).starts_with("40755 ")) << group;
   }
+
+  // Below a root whose name is not UTF-8, the maps naming its paths take the
+  // binary form, and the layout is whole.
+  const std::string odd = dir / "r\xff";
+  sl::test::makeDirs(odd);
+  const ProgramResult result = stowline({"fixture", "--root", odd, "--apps", "2", "--groups", "1"});
+  EXPECT_EQ(result.status, 0) << result.err;
+  for (const char* map : {"/private/var/mobile/Library/Caches/com.vantor.stowline.plist",
+                          "/private/var/stowd/Library/Stowline/SafeHarbor.plist"}) {
+    EXPECT_FALSE(sl::dictionaryWithContentsOfURL(sl::URL::fileURLWithPath(odd + map, false)).isNull()) << map;
+  }
 }
 
 TEST(FixtureTest, RefusesWhatItMustNotWriteInto) {
