@@ -4,15 +4,19 @@
 #include "Registry/EmbeddedRegistry.h"
 
 #include <fcntl.h>
+#include <sys/file.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <map>
 
 #include "FileManager/SLFileManager.h"
 #include "Platform/AtomicFile.h"
+#include "Platform/Mutations.h"
 #include "Platform/UniqueFd.h"
 #include "Support/Errors.h"
 #include "Support/Log.h"
@@ -131,8 +135,8 @@ int compareVersions(const std::string& a, const std::string& b) {
 
 }  // namespace rg
 
-EmbeddedRegistry::EmbeddedRegistry(SLGlobalConfiguration& configuration, rg::Database db)
-    : configuration_(configuration), db_(std::move(db)) {}
+EmbeddedRegistry::EmbeddedRegistry(SLGlobalConfiguration& configuration, sl::UniqueFd lock, rg::Database db)
+    : configuration_(configuration), lock_(std::move(lock)), db_(std::move(db)) {}
 
 namespace {
 // The configuration's data directory is INSTALLER_BASE/Library/Stowline: the
@@ -142,6 +146,35 @@ sl::URL installerBaseOf(SLGlobalConfiguration& configuration) {
 }
 constexpr char kRegistryDirectory[] = "/Library/Registry";
 constexpr char kDatabaseName[] = "registry.sqlite";
+constexpr char kLockName[] = "registry.lock";
+
+// Opens the lock file, making it when it is missing; 0 or the errno. flock
+// needs no more than a read-only descriptor. A link is not followed and
+// only a regular file serves (a fifo or a device is never read).
+int openLockFile(const std::string& path, sl::UniqueFd* lock) {
+  sl::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+  if (!fd) {
+    const int openErrno = errno;
+    if (openErrno != ENOENT) return openErrno;
+    // Its content and durability do not matter: lost, it is made again.
+    fd = sl::UniqueFd(sl::mut::open(path.c_str(), O_RDONLY | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0644));
+    if (!fd) return errno;
+  }
+  struct stat st;
+  if (::fstat(fd.get(), &st) != 0) return errno;
+  if (!S_ISREG(st.st_mode)) return S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
+  *lock = std::move(fd);
+  return 0;
+}
+
+// Takes (or converts an exclusive lock to) the shared lock; 0 or the errno.
+int lockShared(const sl::UniqueFd& lock) {
+  while (::flock(lock.get(), LOCK_SH) != 0) {
+    const int lockErrno = errno;
+    if (lockErrno != EINTR) return lockErrno;
+  }
+  return 0;
+}
 }  // namespace
 
 std::string EmbeddedRegistry::databasePathFor(SLGlobalConfiguration& configuration) {
@@ -163,22 +196,66 @@ std::shared_ptr<EmbeddedRegistry> EmbeddedRegistry::open(SLGlobalConfiguration& 
   for (const std::string& directory : {registryDirectory, bundleRoot, dataRoot, groupRoot}) {
     if (!fm.createDirectoryAtURL(sl::URL::fileURLWithPath(directory, true), true, 0755, error)) return nullptr;
   }
+  // Recovery undoes every operation in flight, so it runs only in an open
+  // that has the registry alone: an exclusive lock, granted when no other
+  // registry object (here or in another process) holds its shared one. An
+  // open that is not alone waits for any recovery under way, then leaves
+  // the operations in flight to their owners. Locks of a killed process go
+  // with it.
+  const std::string lockPath = registryDirectory + "/" + kLockName;
+  auto failed = [&](sl::Error record) -> std::shared_ptr<EmbeddedRegistry> {
+    sl::fail(error, std::move(record));
+    return nullptr;
+  };
+  sl::UniqueFd lock;
+  if (const int openErrno = openLockFile(lockPath, &lock); openErrno != 0) {
+    return failed(_CreateError(kFunctionName, __LINE__, sl::kPOSIXErrorDomain, openErrno,
+                               "Cannot open the registry's lock file %s: %s", lockPath, strerror(openErrno)));
+  }
+  bool alone = true;
+  int lockErrno = 0;
+  if (::flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
+    lockErrno = errno;
+    if (lockErrno == EWOULDBLOCK) {
+      alone = false;
+      lockErrno = lockShared(lock);
+    }
+  }
+  if (lockErrno != 0) {
+    return failed(_CreateError(kFunctionName, __LINE__, sl::kPOSIXErrorDomain, lockErrno,
+                               "Cannot lock the registry's lock file %s: %s", lockPath, strerror(lockErrno)));
+  }
+
   const std::string databasePath = databasePathFor(configuration);
   std::optional<rg::Database> db = rg::Database::open(databasePath, error);
   if (!db) return nullptr;
 
-  std::shared_ptr<EmbeddedRegistry> registry(new EmbeddedRegistry(configuration, std::move(*db)));
+  std::shared_ptr<EmbeddedRegistry> registry(new EmbeddedRegistry(configuration, std::move(lock), std::move(*db)));
   registry->databasePath_ = databasePath;
   registry->bundleRoot_ = bundleRoot;
   registry->dataRoot_ = dataRoot;
   registry->groupRoot_ = groupRoot;
   if (!registry->createSchema(error)) return nullptr;
+  if (!alone) {
+    std::optional<rg::Statement> count = registry->db_.prepare("SELECT COUNT(*) FROM operations", nullptr);
+    const int64_t inFlight = count && count->step(nullptr) ? count->integer(0) : 0;
+    if (inFlight > 0) {
+      SLLog(sl::kLogLevelNotice, kFunctionName,
+            "The registry at %s is open elsewhere: recovery of its operations in flight (%lld) is left to a later open",
+            databasePath, static_cast<long long>(inFlight));
+    }
+    return registry;
+  }
   sl::Error recoveryError;
   if (!registry->recover(&recoveryError)) {
     // An operation that could not be undone or finished stays recorded and
     // is tried again at the next open; the registry itself is usable.
     SLLog(sl::kLogLevelError, kFunctionName, "Recovery of the registry at %s is incomplete: %@", databasePath,
           recoveryError);
+  }
+  if (const int downgradeErrno = lockShared(registry->lock_); downgradeErrno != 0) {
+    return failed(_CreateError(kFunctionName, __LINE__, sl::kPOSIXErrorDomain, downgradeErrno,
+                               "Cannot lock the registry's lock file %s: %s", lockPath, strerror(downgradeErrno)));
   }
   return registry;
 }

@@ -4,6 +4,7 @@
 // Layout below the system root (the bases come from the configuration the
 // registry is opened with):
 //   ROOT/private/var/stowd/Library/Registry/registry.sqlite   the database
+//   ROOT/private/var/stowd/Library/Registry/registry.lock     held by every open registry
 //   ROOT/private/var/stowd/Containers/Bundle/<UUID>/NAME.app   bundle containers
 //   ROOT/private/var/mobile/Containers/Data/<UUID>/            data containers
 //   ROOT/private/var/mobile/Containers/Shared/<UUID>/          group containers
@@ -14,11 +15,13 @@
 // will create and every move it will make. Then come the file-system steps,
 // then one transaction that records the new state and marks the operation
 // done, then the cleanup (the replaced bundle container, the package), and
-// finally the operation row goes. Opening the registry runs recovery: an
-// operation not marked done is undone (bundles moved back into the package,
-// the containers it made removed: they hold no user data yet, since data is
-// moved in only after the install returned), one marked done is finished
-// (its cleanup repeated). Every recovery step can be repeated.
+// finally the operation row goes. Opening the registry runs recovery (when
+// no other registry object has it open, below): an operation not marked
+// done is undone (bundles moved back into the package, never through a
+// link in it, see rg::undoMove; the containers it made removed: they hold
+// no user data yet, since data is moved in only after the install
+// returned), one marked done is finished (its cleanup repeated). Every
+// recovery step can be repeated.
 //
 // Durability. The database commits with synchronous=FULL in WAL mode, and
 // no commit reaches the disk before the file-system changes it may depend
@@ -35,10 +38,15 @@
 // is present is always whole, and undoing a move whose source is gone copies
 // the bundle back the same way.
 //
-// Threads: one mutex serialises every call on one registry object. Two
-// processes share the database safely (SQLite locks), but installs from two
-// processes into one root at once are not supported: recovery assumes that
-// every pending operation belongs to a dead process.
+// Threads and processes: one mutex serialises every call on one registry
+// object; two objects, in one process or two, share the database safely
+// (SQLite locks). Every object holds a shared flock on "registry.lock"
+// beside the database for its whole life, and recovery runs only in an open
+// that first gets that lock exclusively, that is with no other object open:
+// an operation in flight may otherwise belong to a live install, which
+// recovery would undo under it. An open that is not alone leaves the
+// operations in flight to a later open that is (a notice says how many).
+// Installs from two objects into one root at once are still not supported.
 #pragma once
 
 #include <cstdint>
@@ -51,6 +59,7 @@
 #include "Configuration/SLGlobalConfiguration.h"
 #include "Platform/ApplicationRegistry.h"
 #include "Platform/InstallerLibrary.h"
+#include "Platform/UniqueFd.h"
 #include "Registry/Database.h"
 
 // Codes of RGErrorDomain.
@@ -76,9 +85,11 @@ class EmbeddedRegistry : public RGApplicationWorkspace,
                          public std::enable_shared_from_this<EmbeddedRegistry> {
  public:
   // Opens (creating) the registry of the layout that `configuration`
-  // describes and runs recovery. The configuration must outlive the
-  // registry; the built-in applications are its system catalogue. Null on
-  // failure.
+  // describes and, when no other registry object has it open, runs
+  // recovery. The configuration must outlive the registry; the built-in
+  // applications are its system catalogue. Null on failure, also when the
+  // lock file cannot be opened or locked ("Cannot open the registry's lock
+  // file PATH: ...", "Cannot lock the registry's lock file PATH: ...").
   static std::shared_ptr<EmbeddedRegistry> open(SLGlobalConfiguration& configuration, sl::Error* error);
 
   // Where the database of that layout lives; computes only, creates nothing.
@@ -86,6 +97,10 @@ class EmbeddedRegistry : public RGApplicationWorkspace,
 
   // ---- RGApplicationWorkspace ----
   bool applicationIsInstalled(const sl::String& identifier) override;
+  // Every refused install consumes its package, except one of a package
+  // that lies inside the registry's own layout or holds it ("Package PATH
+  // lies inside the registry's own containers", "... holds ...";
+  // kRGInvalidPackageError), which is kept: it is what the registry records.
   bool installApplication(const sl::URL& path, const sl::Dictionary& withOptions, sl::Error* error,
                           const RGProgressHandler& usingBlock) override;
   using RGApplicationWorkspace::installApplication;
@@ -124,7 +139,7 @@ class EmbeddedRegistry : public RGApplicationWorkspace,
   std::string dataContainerForIdentifier(const std::string& identifier);
 
  private:
-  EmbeddedRegistry(SLGlobalConfiguration& configuration, rg::Database db);
+  EmbeddedRegistry(SLGlobalConfiguration& configuration, sl::UniqueFd lock, rg::Database db);
 
   bool createSchema(sl::Error* error);
   bool recover(sl::Error* error);  // Recovery.cc
@@ -136,6 +151,9 @@ class EmbeddedRegistry : public RGApplicationWorkspace,
   std::vector<std::pair<std::string, std::string>> groupsOf(const std::string& identifier);
 
   SLGlobalConfiguration& configuration_;
+  // The lock file, locked shared; declared before db_ so that the lock
+  // outlives the connection.
+  sl::UniqueFd lock_;
   rg::Database db_;
   std::recursive_mutex mutex_;
   std::string databasePath_;

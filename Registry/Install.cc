@@ -5,7 +5,9 @@
 #include <sys/stat.h>
 
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
+#include <memory>
 #include <set>
 
 #include "FileManager/SLFileManager.h"
@@ -23,6 +25,45 @@ constexpr char kFunctionName[] = "-[EmbeddedRegistry installApplication:withOpti
 constexpr char kApplicationGroupsKey[] = "PBApplicationGroups";
 constexpr char kBundleVersionKey[] = "PBBundleVersion";
 constexpr char kCatalogueBundleVersionKey[] = "PBBundleVersion";
+
+// The real path of `path`, or empty when it cannot be resolved.
+std::string realPathOf(const std::string& path) {
+  const std::unique_ptr<char, decltype(&std::free)> resolved(::realpath(path.c_str(), nullptr), &std::free);
+  return resolved ? std::string(resolved.get()) : std::string();
+}
+
+// Whether `path` is `directory` or lies below it (both absolute).
+bool within(const std::string& path, const std::string& directory) {
+  if (path.empty() || directory.empty()) return false;
+  if (directory == "/") return true;
+  return path.compare(0, directory.size(), directory) == 0 &&
+         (path.size() == directory.size() || path[directory.size()] == '/');
+}
+
+// How a package meets the registry's own places (`own`): nullptr when it
+// does not, else "lies inside" or "holds". Consuming such a package would
+// remove what the registry records, so links are resolved as the removal
+// would meet them: the package as named, where its name stands (its
+// directory resolved; removal does not follow a link at the name), and
+// where it leads (the layout is read through a link at the name).
+const char* overlapWithOwnPlaces(const std::string& packagePath, const std::vector<std::string>& own) {
+  std::string named = packagePath;
+  while (named.size() > 1 && named.back() == '/') named.pop_back();
+  const size_t slash = named.rfind('/');
+  const std::string directory = slash == std::string::npos ? std::string() : realPathOf(named.substr(0, slash + 1));
+  const std::string standing =
+      directory.empty() ? std::string() : (directory == "/" ? "" : directory) + named.substr(slash);
+  const std::string places[] = {named, standing, realPathOf(named)};
+  for (const std::string& root : own) {
+    for (const std::string& ownPlace : {root, realPathOf(root)}) {
+      for (const std::string& place : places) {
+        if (within(place, ownPlace)) return "lies inside";
+        if (within(ownPlace, place)) return "holds";
+      }
+    }
+  }
+  return nullptr;
+}
 
 struct PlannedGroup {
   std::string identifier;
@@ -48,16 +89,20 @@ bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Diction
                                 {RGProgressStatusKey, sl::String(status)}});
     }
   };
-  // Every refusal consumes the package and tells the handler before the
-  // call returns.
-  auto refuse = [&](const char* name, const sl::Error& record) {
-    if (!packagePath.empty()) (void)fm.removeItemAtURL(path);
+  // Every refusal tells the handler before the call returns...
+  auto tell = [&](const char* name, const sl::Error& record) {
     if (usingBlock) {
       usingBlock(sl::Dictionary{{RGProgressErrorKey, sl::String(name)},
                                 {RGProgressErrorDescriptionKey, record.localizedDescription()},
                                 {RGProgressErrorDetailKey, sl::String(packagePath)}});
     }
     return sl::fail(error, record);
+  };
+  // ...and consumes the package, except the refusal of a package inside the
+  // registry's own layout (below), which keeps it.
+  auto refuse = [&](const char* name, const sl::Error& record) {
+    if (!packagePath.empty()) (void)fm.removeItemAtURL(path);
+    return tell(name, record);
   };
 
   // A package refused because a built-in application is not older is
@@ -79,6 +124,16 @@ bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Diction
   };
 
   report(0, "Validating");
+  // A package inside the registry's own layout (an installed bundle, a data
+  // or group container, the database's directory), or one that holds it, is
+  // refused before anything else, and kept: consuming it would remove what
+  // the registry records.
+  if (const char* overlap = overlapWithOwnPlaces(
+          packagePath, {bundleRoot_, dataRoot_, groupRoot_, databasePath_.substr(0, databasePath_.rfind('/'))})) {
+    return tell(kRGProgressErrorInvalidPackage,
+                _CreateError(kFunctionName, __LINE__, RGErrorDomain, kRGInvalidPackageError,
+                             "Package %s %s the registry's own containers", packagePath, overlap));
+  }
   const sl::String identifierOption = withOptions.get(RGBundleIdentifierOptionKey).asString();
   if (packagePath.empty() || identifierOption.isNull()) {
     return refuse(kRGProgressErrorInvalidOptions,
@@ -309,12 +364,7 @@ bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Diction
     sl::Error undoError;
     if (!recoverOperation(operation, false, &undoError)) {
       SLLog(sl::kLogLevelError, kFunctionName, "Failed to undo the install of %s: %@", identifier, undoError);
-      if (usingBlock) {
-        usingBlock(sl::Dictionary{{RGProgressErrorKey, sl::String(kRGProgressErrorInstallFailed)},
-                                  {RGProgressErrorDescriptionKey, record.localizedDescription()},
-                                  {RGProgressErrorDetailKey, sl::String(packagePath)}});
-      }
-      return sl::fail(error, record);
+      return tell(kRGProgressErrorInstallFailed, record);
     }
     return refuse(kRGProgressErrorInstallFailed, record);
   };

@@ -1,8 +1,10 @@
 #include "Registry/Moves.h"
 
+#include <fcntl.h>
 #include <stdio.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 
@@ -10,15 +12,19 @@
 #include "Platform/AtomicFile.h"
 #include "Platform/Copyfile.h"
 #include "Platform/Mutations.h"
+#include "Platform/Removefile.h"
 #include "Platform/URL.h"
+#include "Platform/UniqueFd.h"
 #include "Registry/EmbeddedRegistry.h"
 #include "Support/Errors.h"
+#include "Support/Log.h"
 
 namespace rg {
 
 namespace {
 
 constexpr char kFunctionName[] = "rg::moveIntoContainer";
+constexpr char kUndoFunctionName[] = "rg::undoMove";
 constexpr sl::copyfile_flags_t kCopyFlags = sl::COPYFILE_ALL | sl::COPYFILE_RECURSIVE | sl::COPYFILE_NOFOLLOW;
 
 std::string besideWithPrefix(const std::string& path, const std::string& directory, const char* suffix) {
@@ -41,8 +47,9 @@ bool renameItem(const std::string& from, const std::string& to, int* failedErrno
   return false;
 }
 
-bool posixFailure(sl::Error* error, int code, const char* call, const std::string& from, const std::string& to) {
-  return sl::fail(error, _CreateError(kFunctionName, __LINE__, sl::kPOSIXErrorDomain, code, "%s of %s to %s failed: %s",
+bool posixFailure(sl::Error* error, int code, const char* call, const std::string& from, const std::string& to,
+                  const char* function = kFunctionName) {
+  return sl::fail(error, _CreateError(function, __LINE__, sl::kPOSIXErrorDomain, code, "%s of %s to %s failed: %s",
                                       call, from, to, strerror(code)));
 }
 
@@ -57,22 +64,125 @@ bool syncRenamed(const std::string& from, const std::string& to, sl::Error* erro
                                       syncError.localizedDescription()));
 }
 
-// Copies `from` to a temporary name in `directory`, flushes the copy, then
-// renames it to `to`.
-bool copyThenRename(const std::string& from, const std::string& to, const char* suffix, sl::Error* error) {
-  const std::string temporary = besideWithPrefix(to, parentOf(to), suffix);
-  if (!removeTree(temporary, error)) return false;
-  if (sl::copyfile(from.c_str(), temporary.c_str(), nullptr, kCopyFlags) != 0) {
+// The last component of a path recorded by the registry (absolute, no
+// trailing slash).
+std::string nameOf(const std::string& path) { return path.substr(path.rfind('/') + 1); }
+
+// A directory held by a descriptor (O_PATH), with the path it was opened
+// by, for records. at(name) reaches an entry of it through the descriptor's
+// entry in /proc: the directory held, whatever its path names by now, with
+// the name resolved there only (removefile and copyfile never follow a link
+// at it).
+struct PinnedDirectory {
+  sl::UniqueFd fd;
+  std::string path;
+
+  std::string self() const { return "/proc/self/fd/" + std::to_string(fd.get()); }
+  std::string at(const std::string& name) const { return self() + "/" + name; }
+  std::string shown(const std::string& name) const { return path + "/" + name; }
+};
+
+// Opens the directory that holds a move's source without following a link
+// at the package directory or anywhere below it: the package directory
+// with O_NOFOLLOW, then each further component relative to the one before,
+// with O_NOFOLLOW too (one openat per component works on every kernel, and
+// a package is rarely more than one level deep). A source that is not below
+// the package (a placeholder's source is the package itself) has its own
+// directory opened so, without following a link at that directory's name.
+// On failure the descriptor is invalid and *failedErrno says why.
+PinnedDirectory openSourceDirectory(const std::string& source, const std::string& packagePath, int* failedErrno) {
+  const size_t slash = source.rfind('/');
+  PinnedDirectory directory{sl::UniqueFd(), slash == 0 ? "/" : source.substr(0, slash)};
+  std::string anchor = directory.path;
+  std::string below;  // the components between the package and the source's name
+  if (!packagePath.empty() && slash > packagePath.size() && source.compare(0, packagePath.size(), packagePath) == 0 &&
+      source[packagePath.size()] == '/') {
+    anchor = packagePath;
+    below = source.substr(packagePath.size() + 1, slash - packagePath.size() - 1);
+  }
+  sl::UniqueFd fd(::open(anchor.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  if (!fd) {
+    *failedErrno = errno;
+    return directory;
+  }
+  size_t start = 0;
+  while (start < below.size()) {
+    const size_t end = std::min(below.find('/', start), below.size());
+    const std::string component = below.substr(start, end - start);
+    start = end + 1;
+    if (component.empty()) continue;
+    if (component == "." || component == "..") {  // not below the package
+      *failedErrno = EXDEV;
+      return directory;
+    }
+    sl::UniqueFd next(::openat(fd.get(), component.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    if (!next) {
+      *failedErrno = errno;
+      return directory;
+    }
+    fd = std::move(next);
+  }
+  directory.fd = std::move(fd);
+  return directory;
+}
+
+// The errnos of openSourceDirectory that mean the source's place is gone:
+// removed, replaced by something that is not a directory or by a link
+// (O_PATH | O_DIRECTORY | O_NOFOLLOW gives ENOTDIR for one), or outside the
+// package.
+bool placeIsGone(int code) { return code == ENOENT || code == ENOTDIR || code == ELOOP || code == EXDEV; }
+
+bool openFailure(sl::Error* error, int code, const std::string& path, const char* function = kUndoFunctionName) {
+  return sl::fail(error, _CreateError(function, __LINE__, sl::kPOSIXErrorDomain, code, "open of %s failed: %s",
+                                      path, strerror(code)));
+}
+
+// Removes `name` in `directory` (a tree; no link followed); absent is
+// success.
+bool removeIn(const PinnedDirectory& directory, const std::string& name, sl::Error* error) {
+  struct stat st;
+  if (::fstatat(directory.fd.get(), name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0 && errno == ENOENT) return true;
+  if (sl::removefile(directory.at(name).c_str(), nullptr, sl::REMOVEFILE_RECURSIVE) == 0) return true;
+  const int removeErrno = errno;
+  if (removeErrno == ENOENT) return true;
+  return sl::fail(error, _CreateError(kUndoFunctionName, __LINE__, sl::kPOSIXErrorDomain, removeErrno,
+                                      "removal of %s failed: %s", directory.shown(name), strerror(removeErrno)));
+}
+
+// Flushes a rename of `from` into `directory`: that directory, and the one
+// `from` left when it is another.
+bool syncRenamedInto(const PinnedDirectory& directory, const std::string& from, const std::string& to,
+                     sl::Error* error) {
+  sl::Error syncError;
+  if (sl::syncDirectory(directory.self(), &syncError) &&
+      (parentOf(from) == directory.path || sl::syncParentDirectory(from, &syncError))) {
+    return true;
+  }
+  const int code = static_cast<int>(syncError.code());
+  return sl::fail(error, _CreateError(kFunctionName, __LINE__, sl::kPOSIXErrorDomain, code,
+                                      "rename of %s to %s is not durable: %s", from, to, strerror(code)));
+}
+
+// Copies `from` to ".NAME<suffix>" in `directory`, flushes the copy, then
+// renames it to NAME there.
+bool copyThenRename(const std::string& from, const PinnedDirectory& directory, const std::string& name,
+                    const char* suffix, sl::Error* error) {
+  const std::string temporaryName = "." + name + suffix;
+  const std::string temporary = directory.shown(temporaryName);
+  if (!removeIn(directory, temporaryName, error)) return false;
+  if (sl::copyfile(from.c_str(), directory.at(temporaryName).c_str(), nullptr, kCopyFlags) != 0) {
     const int copyErrno = errno;
     return posixFailure(error, copyErrno, "copyfile", from, temporary);
   }
   sl::Error syncError;
-  if (!sl::syncTree(temporary, &syncError)) {
+  if (!sl::syncTree(directory.at(temporaryName), &syncError)) {
     return posixFailure(error, static_cast<int>(syncError.code()), "fsync of the copy", from, temporary);
   }
-  int renameErrno = 0;
-  if (!renameItem(temporary, to, &renameErrno)) return posixFailure(error, renameErrno, "rename", temporary, to);
-  return syncRenamed(temporary, to, error);
+  if (sl::mut::renameat(directory.fd.get(), temporaryName.c_str(), directory.fd.get(), name.c_str()) != 0) {
+    const int renameErrno = errno;
+    return posixFailure(error, renameErrno, "rename", temporary, directory.shown(name));
+  }
+  return syncRenamedInto(directory, temporary, directory.shown(name), error);
 }
 
 }  // namespace
@@ -90,7 +200,14 @@ bool moveIntoContainer(const Move& move, sl::Error* error) {
   int renameErrno = 0;
   if (renameItem(move.source, move.destination, &renameErrno)) return syncRenamed(move.source, move.destination, error);
   if (renameErrno != EXDEV) return posixFailure(error, renameErrno, "rename", move.source, move.destination);
-  if (!copyThenRename(move.source, move.destination, ".partial", error)) return false;
+  const std::string containerPath = parentOf(move.destination);
+  sl::UniqueFd containerFd(::open(containerPath.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  if (!containerFd) {
+    const int openErrno = errno;
+    return openFailure(error, openErrno, containerPath, kFunctionName);
+  }
+  const PinnedDirectory container{std::move(containerFd), containerPath};
+  if (!copyThenRename(move.source, container, nameOf(move.destination), ".partial", error)) return false;
   // The source leaves whole or not at all: renamed away first, then removed.
   const std::string trash = trashPathFor(move.source);
   if (!removeTree(trash, error)) return false;
@@ -99,25 +216,47 @@ bool moveIntoContainer(const Move& move, sl::Error* error) {
   return removeTree(trash, error);
 }
 
-bool undoMove(const Move& move, sl::Error* error) {
-  // The package is its owner's to remove once the install call has returned,
-  // whatever the outcome: after an undo that failed there, the owner may
-  // have removed it before the next open finishes the undo. With nowhere
-  // left to bring the item back to, it goes instead, as the package would
-  // have.
-  if (!present(parentOf(move.source))) {
-    return removeTree(move.destination, error) && removeTree(trashPathFor(move.source), error);
+bool undoMove(const Move& move, const std::string& packagePath, sl::Error* error) {
+  int openErrno = 0;
+  const PinnedDirectory directory = openSourceDirectory(move.source, packagePath, &openErrno);
+  if (!directory.fd) {
+    if (!placeIsGone(openErrno)) return openFailure(error, openErrno, directory.path);
+    // The package is its owner's to remove once the install call has
+    // returned, whatever the outcome: after an undo that failed there, the
+    // owner may have removed it before the next open finishes the undo, or
+    // put a link in the way, which leads out of the package. With nowhere
+    // safe to bring the item back to, it goes instead, as the package would
+    // have. No trash is left to remove: the directory that would hold it is
+    // gone, or is not the package's.
+    if (present(move.destination)) {
+      SLLog(sl::kLogLevelNotice, kUndoFunctionName,
+            "Undo of the move of %s: its directory is gone or reached through a link; removing %s", move.source,
+            move.destination);
+    }
+    return removeTree(move.destination, error);
   }
-  if (!present(move.source) && present(move.destination)) {
-    int renameErrno = 0;
-    if (!renameItem(move.destination, move.source, &renameErrno)) {
-      if (renameErrno != EXDEV) return posixFailure(error, renameErrno, "rename", move.destination, move.source);
-      if (!copyThenRename(move.destination, move.source, ".rgrestore", error)) return false;
-    } else if (!syncRenamed(move.destination, move.source, error)) {
-      return false;
+  const std::string name = nameOf(move.source);
+  struct stat st;
+  const bool sourcePresent = ::fstatat(directory.fd.get(), name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0;
+  if (!sourcePresent && present(move.destination)) {
+    if (sl::mut::renameat(AT_FDCWD, move.destination.c_str(), directory.fd.get(), name.c_str()) == 0) {
+      if (!syncRenamedInto(directory, move.destination, move.source, error)) return false;
+    } else {
+      const int renameErrno = errno;
+      if (renameErrno != EXDEV) {
+        return posixFailure(error, renameErrno, "rename", move.destination, move.source, kUndoFunctionName);
+      }
+      if (!copyThenRename(move.destination, directory, name, ".rgrestore", error)) return false;
     }
   }
-  return removeTree(trashPathFor(move.source), error);
+  return removeIn(directory, "." + name + ".rgtrash", error);
+}
+
+bool removeTrash(const Move& move, const std::string& packagePath, sl::Error* error) {
+  int openErrno = 0;
+  const PinnedDirectory directory = openSourceDirectory(move.source, packagePath, &openErrno);
+  if (directory.fd) return removeIn(directory, "." + nameOf(move.source) + ".rgtrash", error);
+  return placeIsGone(openErrno) || openFailure(error, openErrno, directory.path);
 }
 
 }  // namespace rg

@@ -26,10 +26,23 @@ bool moveIntoContainer(const Move& move, sl::Error* error);
 // Brings the source back when it is gone and the destination is there
 // (rename, or across volumes a copy to ".NAME.rgrestore" beside the source
 // renamed into place), then removes the trash. A source that is there is
-// whole and is left alone. When the source's directory is gone (the
-// package's owner removed the package), the destination is removed instead.
-// The destination's container is not removed here.
-bool undoMove(const Move& move, sl::Error* error);
+// whole and is left alone. The destination's container is not removed here.
+//
+// The package (`packagePath`, the install's package directory) belongs to
+// someone else and may have changed since the install: every step on the
+// source's side works on a descriptor of the source's directory, opened
+// without following a link at the package directory or below it (a
+// placeholder's source is the package itself: then its directory is opened
+// without following a link at its own name). When that directory is gone,
+// is not a directory or is reached through a link, the destination is
+// removed instead, as the package would have been, with the notice "Undo of
+// the move of SOURCE: its directory is gone or reached through a link;
+// removing DESTINATION".
+bool undoMove(const Move& move, const std::string& packagePath, sl::Error* error);
+
+// Removes the source's trash name, on the same descriptor as undoMove; a
+// source directory that is gone or reached through a link holds none.
+bool removeTrash(const Move& move, const std::string& packagePath, sl::Error* error);
 
 // Removes a tree; absent (ENOENT, or ENOTDIR on the way) is success.
 bool removeTree(const std::string& path, sl::Error* error);

@@ -101,7 +101,7 @@ bool EmbeddedRegistry::recoverOperation(int64_t operation, bool done, sl::Error*
   if (!row) return false;
   // Backwards: the application, moved first, comes back last.
   for (auto move = row->moves.rbegin(); move != row->moves.rend(); ++move) {
-    if (!rg::undoMove(*move, error)) return false;
+    if (!rg::undoMove(*move, row->packagePath, error)) return false;
   }
   if (!removeRecorded(row->newBundleContainer, error)) return false;
   for (const std::string& path : row->madePaths) {
@@ -118,7 +118,7 @@ bool EmbeddedRegistry::finishOperation(int64_t operation, sl::Error* error) {
   }
   if (!removeRecorded(row->packagePath, error)) return false;
   for (const rg::Move& move : row->moves) {
-    if (!removeRecorded(rg::trashPathFor(move.source), error)) return false;
+    if (!rg::removeTrash(move, row->packagePath, error)) return false;
   }
   return deleteFinishedOperation(db_, operation, error);
 }

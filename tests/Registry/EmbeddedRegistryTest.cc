@@ -197,6 +197,95 @@ TEST(EmbeddedRegistryTest, RefusalsBlacklistAndBuiltInApplications) {
   EXPECT_FALSE(registry->applicationIsInstalled("com.example.unknown"));
 }
 
+// Recovery runs only in an open that has the registry alone: an install
+// under way in another registry object keeps its operation, and an open
+// made once that object is closed recovers what it left.
+TEST(EmbeddedRegistryTest, RecoveryLeavesTheOperationsOfOpenRegistriesAlone) {
+  RegistryRoot root;
+  auto registry = root.open();
+  const std::string package = root / "private/var/mobile/Applications/C/Staging";
+  sl::test::LogCapture log;
+  struct Stop {};
+  bool stop = false;
+  // While the install registers (its bundle moved, its state not yet
+  // committed) another object opens and closes; with `stop` the install
+  // then ends there, as a crash would end it, with its registry still open.
+  const RGProgressHandler openAnother = [&](const sl::Dictionary& report) {
+    if (!(report.get(RGProgressStatusKey).asString() == "Registering")) return;
+    log.clear();
+    EXPECT_TRUE(root.open());
+    EXPECT_EQ(log.installer(), std::vector{sl::test::installerLine(
+                                   sl::kLogLevelNotice, "+[EmbeddedRegistry open:error:]",
+                                   "The registry at " + registry->databasePath() +
+                                       " is open elsewhere: recovery of its operations in flight (1) is left to a "
+                                       "later open")});
+    EXPECT_FALSE(exists(package + "/Payload/App.app")) << "moved back under the install";
+    if (stop) throw Stop{};
+  };
+
+  makeCustomerPackage(package, "com.example.live");
+  ASSERT_TRUE(install(*registry, package, "com.example.live", RGPackageTypeCustomer, nullptr, openAnother));
+  const std::string bundle = registry->bundleProxyForIdentifier("com.example.live")->bundleURL().path();
+  EXPECT_EQ(sl::test::readFile(bundle + "/Executable"), "binary of com.example.live");
+
+  stop = true;
+  makeCustomerPackage(package, "com.example.stopped");
+  EXPECT_THROW(install(*registry, package, "com.example.stopped", RGPackageTypeCustomer, nullptr, openAnother), Stop);
+  registry.reset();
+  registry = root.open();  // alone now: recovers
+  EXPECT_EQ(sl::test::readFile(package + "/Payload/App.app/Executable"), "binary of com.example.stopped");
+  EXPECT_FALSE(registry->applicationIsInstalled("com.example.stopped"));
+
+  // ---- Without its lock file the registry does not open ----
+  const std::string lock = root / "private/var/stowd/Library/Registry/registry.lock";
+  registry.reset();
+  sl::test::forceRemove(lock);
+  sl::test::makeSymlink(root / "elsewhere", lock);
+  sl::Error error;
+  EXPECT_FALSE(EmbeddedRegistry::open(root.configuration(), &error));
+  sl::test::expectPOSIXRecord(error, ELOOP,
+                              "Cannot open the registry's lock file " + lock + ": Too many levels of symbolic links",
+                              "+[EmbeddedRegistry open:error:]");
+  EXPECT_FALSE(exists(root / "elsewhere"));
+}
+
+// A package inside the registry's own layout, or holding it, is refused and
+// kept: consuming it would remove what the registry records.
+TEST(EmbeddedRegistryTest, PackagesInTheRegistrysOwnLayoutAreRefusedAndKept) {
+  RegistryRoot root;
+  auto registry = root.open();
+  makeCustomerPackage(root / "pkg", "com.example.own");
+  ASSERT_TRUE(install(*registry, root / "pkg", "com.example.own", RGPackageTypeCustomer));
+  const auto proxy = registry->bundleProxyForIdentifier("com.example.own");
+  const std::string bundle = proxy->bundleURL().path();
+  const std::string data = proxy->dataContainerURL().path();
+  sl::test::writeFile(data + "/Documents/keep", "user data");
+  sl::test::makeSymlink(proxy->bundleContainerURL().path(), root / "link");
+  const struct {
+    std::string package;
+    const char* packageType;
+    const char* overlap;
+  } cases[] = {
+      {bundle, RGPackageTypePlaceholder, "lies inside"},  // over the installed application
+      {data, RGPackageTypeCustomer, "lies inside"},
+      {root / "link/App.app", RGPackageTypePlaceholder, "lies inside"},
+      {root / "private/var/stowd", RGPackageTypeCustomer, "holds"},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.package);
+    Reports reports;
+    sl::Error error;
+    EXPECT_FALSE(install(*registry, c.package, "com.example.own", c.packageType, &error, reports.handler()));
+    sl::test::expectRecord(error, RGErrorDomain, kRGInvalidPackageError,
+                           "Package " + c.package + " " + c.overlap + " the registry's own containers",
+                           "-[EmbeddedRegistry installApplication:withOptions:error:usingBlock:]");
+    EXPECT_EQ(reports.lastError(), kRGProgressErrorInvalidPackage);
+  }
+  EXPECT_EQ(sl::test::readFile(bundle + "/Executable"), "binary of com.example.own");
+  EXPECT_EQ(sl::test::readFile(data + "/Documents/keep"), "user data");
+  EXPECT_EQ(registry->bundleProxyForIdentifier("com.example.own")->bundleURL().path(), bundle);
+}
+
 TEST(EmbeddedRegistryTest, PackageOnAnotherVolumeIsCopied) {
   RegistryRoot root;
   TempDir other;  // $TMPDIR or /tmp, on the disk

@@ -19,6 +19,7 @@
 #include "Platform/Mutations.h"
 #include "Registry/Database.h"
 #include "Registry/RegistryTestSupport.h"
+#include "TestSupport/Sentinel.h"
 
 namespace {
 
@@ -182,6 +183,65 @@ TEST(RegistryCrashTest, KilledCopyingInstallsRecoverToOldOrNewState) {
     GTEST_SKIP() << "/dev/shm and the temporary directory share a volume";
   runScenario(scenarios()[0], true);
   runScenario(scenarios()[1], true);
+}
+
+// An install stopped after its moves, then links planted in its package by
+// the package's owner: recovery follows none of them. An item whose
+// directory in the package became a link goes (with a notice) instead of
+// coming back; one whose directory is still the package's comes back.
+TEST(RegistryCrashTest, RecoveryFollowsNoLinkPlantedInThePackage) {
+  if (!sl::mut::kFaultInjectionBuilt) GTEST_SKIP() << "a build without fault plans";
+  for (const std::string replaced : {"Staging/Payload", "Staging"}) {
+    SCOPED_TRACE(replaced);
+    RegistryRoot root;
+    const std::string old = root / "private/var/mobile/Applications/C";
+    const std::string package = old + "/Staging";
+    makeCustomerPackage(package, "com.crash.linked");
+    sl::test::writeFile(package + "/Manifest.plist", "m");
+    const std::string bundleRoot = root.open()->bundleContainersRoot();
+    const pid_t child = ::fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+      sl::mut::setPlanForTesting("kill@1:xattr");  // the install type, set once every move is made
+      auto registry = EmbeddedRegistry::open(root.configuration(), nullptr);
+      ::_exit(registry && install(*registry, package, "com.crash.linked", RGPackageTypeCustomer) ? 0 : 1);
+    }
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL) << "status " << status;
+    const std::vector<std::string> containers = entries(bundleRoot);
+    ASSERT_EQ(containers.size(), 1u);
+    ASSERT_TRUE(exists(containers[0] + "/App.app/Info.plist") && exists(containers[0] + "/Manifest.plist"));
+
+    sl::test::Sentinel sentinel;
+    sl::test::forceRemove(old + "/" + replaced);
+    sl::test::makeSymlink(sentinel.path(), old + "/" + replaced);
+    sl::test::LogCapture log;
+    auto registry = root.open();
+    ASSERT_TRUE(registry);
+    EXPECT_EQ(sentinel.changes(), std::vector<std::string>{});
+    auto removing = [&](const std::string& source, const std::string& name) {
+      return sl::test::installerLine(sl::kLogLevelNotice, "rg::undoMove",
+                                     "Undo of the move of " + package + source +
+                                         ": its directory is gone or reached through a link; removing " +
+                                         containers[0] + "/" + name);
+    };
+    if (replaced == "Staging") {
+      EXPECT_EQ(log.installer(), (std::vector{removing("/Manifest.plist", "Manifest.plist"),
+                                              removing("/Payload/App.app", "App.app")}));
+    } else {
+      EXPECT_EQ(log.installer(), std::vector{removing("/Payload/App.app", "App.app")});
+      EXPECT_EQ(sl::test::readFile(package + "/Manifest.plist"), "m");
+    }
+    EXPECT_FALSE(registry->applicationIsInstalled("com.crash.linked"));
+    std::optional<rg::Database> db = rg::Database::open(registry->databasePath(), nullptr);
+    ASSERT_TRUE(db);
+    EXPECT_EQ(column(*db, "PRAGMA integrity_check"), std::set<std::string>{"ok"});
+    EXPECT_EQ(column(*db, "SELECT COUNT(*) FROM operations"), std::set<std::string>{"0"});
+    for (const std::string& made : {bundleRoot, registry->dataContainersRoot(), registry->groupContainersRoot()}) {
+      EXPECT_EQ(entries(made), std::vector<std::string>{}) << made;
+    }
+  }
 }
 
 }  // namespace
