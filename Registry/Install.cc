@@ -125,14 +125,20 @@ bool EmbeddedRegistry::installApplication(const sl::URL& path, const sl::Diction
 
   report(0, "Validating");
   // A package inside the registry's own layout (an installed bundle, a data
-  // or group container, the database's directory), or one that holds it, is
-  // refused before anything else, and kept: consuming it would remove what
-  // the registry records.
+  // or group container, the database's directory) or the built-in
+  // applications, or one that holds them, is refused before anything else,
+  // and kept: consuming it would remove what the registry records or the
+  // system ships.
   if (const char* overlap = overlapWithOwnPlaces(
           packagePath, {bundleRoot_, dataRoot_, groupRoot_, databasePath_.substr(0, databasePath_.rfind('/'))})) {
     return tell(kRGProgressErrorInvalidPackage,
                 _CreateError(kFunctionName, __LINE__, RGErrorDomain, kRGInvalidPackageError,
                              "Package %s %s the registry's own containers", packagePath, overlap));
+  }
+  if (const char* overlap = overlapWithOwnPlaces(packagePath, {configuration_.systemAppsDirectory().path()})) {
+    return tell(kRGProgressErrorInvalidPackage,
+                _CreateError(kFunctionName, __LINE__, RGErrorDomain, kRGInvalidPackageError,
+                             "Package %s %s the built-in applications", packagePath, overlap));
   }
   const sl::String identifierOption = withOptions.get(RGBundleIdentifierOptionKey).asString();
   if (packagePath.empty() || identifierOption.isNull()) {

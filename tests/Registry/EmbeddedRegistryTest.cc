@@ -261,15 +261,19 @@ TEST(EmbeddedRegistryTest, PackagesInTheRegistrysOwnLayoutAreRefusedAndKept) {
   const std::string data = proxy->dataContainerURL().path();
   sl::test::writeFile(data + "/Documents/keep", "user data");
   sl::test::makeSymlink(proxy->bundleContainerURL().path(), root / "link");
+  const std::string builtIn = root.configuration().systemAppsDirectory().path() + "/Built.app";
+  makeBundle(builtIn, "com.example.own");
+  const std::string containers = " the registry's own containers";
   const struct {
     std::string package;
     const char* packageType;
-    const char* overlap;
+    std::string overlap;
   } cases[] = {
-      {bundle, RGPackageTypePlaceholder, "lies inside"},  // over the installed application
-      {data, RGPackageTypeCustomer, "lies inside"},
-      {root / "link/App.app", RGPackageTypePlaceholder, "lies inside"},
-      {root / "private/var/stowd", RGPackageTypeCustomer, "holds"},
+      {bundle, RGPackageTypePlaceholder, "lies inside" + containers},  // over the installed application
+      {data, RGPackageTypeCustomer, "lies inside" + containers},
+      {root / "link/App.app", RGPackageTypePlaceholder, "lies inside" + containers},
+      {root / "private/var/stowd", RGPackageTypeCustomer, "holds" + containers},
+      {builtIn, RGPackageTypePlaceholder, "lies inside the built-in applications"},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.package);
@@ -277,11 +281,12 @@ TEST(EmbeddedRegistryTest, PackagesInTheRegistrysOwnLayoutAreRefusedAndKept) {
     sl::Error error;
     EXPECT_FALSE(install(*registry, c.package, "com.example.own", c.packageType, &error, reports.handler()));
     sl::test::expectRecord(error, RGErrorDomain, kRGInvalidPackageError,
-                           "Package " + c.package + " " + c.overlap + " the registry's own containers",
+                           "Package " + c.package + " " + c.overlap,
                            "-[EmbeddedRegistry installApplication:withOptions:error:usingBlock:]");
     EXPECT_EQ(reports.lastError(), kRGProgressErrorInvalidPackage);
   }
   EXPECT_EQ(sl::test::readFile(bundle + "/Executable"), "binary of com.example.own");
+  EXPECT_TRUE(exists(builtIn + "/Info.plist"));
   EXPECT_EQ(sl::test::readFile(data + "/Documents/keep"), "user data");
   EXPECT_EQ(registry->bundleProxyForIdentifier("com.example.own")->bundleURL().path(), bundle);
 }
