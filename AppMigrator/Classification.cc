@@ -258,4 +258,10 @@ Decision classifyContainer(const URL& container) {
   return classifyContainer(container, probe);
 }
 
+std::map<std::string, size_t> identifierClaims(const std::vector<Dictionary>& records) {
+  std::map<std::string, size_t> claims;
+  for (const Dictionary& record : records) ++claims[record.get(kBundleIdentifierKey).asString().str()];
+  return claims;
+}
+
 }  // namespace sl::migrator

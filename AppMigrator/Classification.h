@@ -10,6 +10,7 @@
 #pragma once
 
 #include <cstdint>
+#include <map>
 #include <optional>
 #include <span>
 #include <string>
@@ -97,5 +98,12 @@ struct Decision {
 
 Decision classifyContainer(const URL& container, ContainerProbe& probe);
 Decision classifyContainer(const URL& container);
+
+// How many of `records` claim each identifier ("BundleIdentifier"). Two
+// containers that claim one would both move their data into that
+// application's one data container, the later over the earlier: the
+// migration leaves every record whose identifier counts more than one in
+// place.
+std::map<std::string, size_t> identifierClaims(const std::vector<Dictionary>& records);
 
 }  // namespace sl::migrator

@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "AppMigrator/Classification.h"
 #include "AppMigrator/OldLayout.h"
 #include "AppMigrator/AppMigrator.h"
 #include "Configuration/SLGlobalConfiguration.h"
@@ -75,23 +76,16 @@ bool SLAppMigrator::runPasses() {
       }
     }
 
-    // Two containers that claim one identifier would both move their data
-    // into that application's one data container, the later replacing what
-    // the earlier moved. Which of them holds the application cannot be
-    // told, so neither is migrated: both stay for the final check.
-    std::map<std::string, std::vector<std::string>> claims;  // identifier -> containers
-    for (const sl::Dictionary& record : records) {
-      claims[record.get(sl::migrator::kBundleIdentifierKey).asString().str()].push_back(
-          record.get(sl::migrator::kContainerPathKey).asString().str());
-    }
+    // Containers that claim one identifier stay for the final check: which
+    // of them holds the application cannot be told.
+    std::map<std::string, size_t> claims = sl::migrator::identifierClaims({records.begin(), records.end()});
     std::erase_if(records, [&](const sl::Dictionary& record) {
       const sl::String identifier = record.get(sl::migrator::kBundleIdentifierKey).asString();
-      const std::vector<std::string>& containers = claims[identifier.str()];
-      if (containers.size() < 2) return false;
+      const size_t claimed = claims[identifier.str()];
+      if (claimed < 2) return false;
       SLMigratorLog(sl::kLogLevelError, kFunctionName,
                     "SLAppMigrator: Leaving %@ in place: %lu containers claim the identifier %@",
-                    record.get(sl::migrator::kContainerPathKey), static_cast<unsigned long>(containers.size()),
-                    identifier);
+                    record.get(sl::migrator::kContainerPathKey), static_cast<unsigned long>(claimed), identifier);
       countItem();
       return true;
     });

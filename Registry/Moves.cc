@@ -27,11 +27,6 @@ constexpr char kFunctionName[] = "rg::moveIntoContainer";
 constexpr char kUndoFunctionName[] = "rg::undoMove";
 constexpr sl::copyfile_flags_t kCopyFlags = sl::COPYFILE_ALL | sl::COPYFILE_RECURSIVE | sl::COPYFILE_NOFOLLOW;
 
-std::string besideWithPrefix(const std::string& path, const std::string& directory, const char* suffix) {
-  const sl::URL url = sl::URL::fileURLWithPath(path, false);
-  return directory + "/." + url.lastPathComponent() + suffix;
-}
-
 std::string parentOf(const std::string& path) {
   return sl::URL::fileURLWithPath(path, false).URLByDeletingLastPathComponent().path();
 }
@@ -67,6 +62,9 @@ bool syncRenamed(const std::string& from, const std::string& to, sl::Error* erro
 // The last component of a path recorded by the registry (absolute, no
 // trailing slash).
 std::string nameOf(const std::string& path) { return path.substr(path.rfind('/') + 1); }
+
+// The name a source is renamed to on its way out, beside it.
+std::string trashNameOf(const std::string& source) { return "." + nameOf(source) + ".rgtrash"; }
 
 // A directory held by a descriptor (O_PATH), with the path it was opened
 // by, for records. at(name) reaches an entry of it through the descriptor's
@@ -187,7 +185,7 @@ bool copyThenRename(const std::string& from, const PinnedDirectory& directory, c
 
 }  // namespace
 
-std::string trashPathFor(const std::string& source) { return besideWithPrefix(source, parentOf(source), ".rgtrash"); }
+std::string trashPathFor(const std::string& source) { return parentOf(source) + "/" + trashNameOf(source); }
 
 bool removeTree(const std::string& path, sl::Error* error) {
   // A path below something that is not a directory is not there either.
@@ -249,13 +247,13 @@ bool undoMove(const Move& move, const std::string& packagePath, sl::Error* error
       if (!copyThenRename(move.destination, directory, name, ".rgrestore", error)) return false;
     }
   }
-  return removeIn(directory, "." + name + ".rgtrash", error);
+  return removeIn(directory, trashNameOf(move.source), error);
 }
 
 bool removeTrash(const Move& move, const std::string& packagePath, sl::Error* error) {
   int openErrno = 0;
   const PinnedDirectory directory = openSourceDirectory(move.source, packagePath, &openErrno);
-  if (directory.fd) return removeIn(directory, "." + nameOf(move.source) + ".rgtrash", error);
+  if (directory.fd) return removeIn(directory, trashNameOf(move.source), error);
   return placeIsGone(openErrno) || openFailure(error, openErrno, directory.path);
 }
 

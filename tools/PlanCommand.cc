@@ -483,10 +483,11 @@ int planCommand(Arguments args) {
     if (items.empty()) rootState = "empty";
   }
   // Containers that claim one identifier stay, as the migration leaves them.
-  std::map<std::string, size_t> claims;
+  std::vector<sl::Dictionary> records;
   for (const Item& item : items) {
-    if (!item.record.isNull()) ++claims[stringOf(item.record, mg::kBundleIdentifierKey)];
+    if (!item.record.isNull()) records.push_back(item.record);
   }
+  std::map<std::string, size_t> claims = mg::identifierClaims(records);
   for (Item& item : items) {
     if (item.record.isNull()) continue;
     const std::string identifier = stringOf(item.record, mg::kBundleIdentifierKey);
