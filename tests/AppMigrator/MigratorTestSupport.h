@@ -24,20 +24,13 @@
 // Reaches the migrator's private operations from the tests.
 class SLAppMigratorTestAccess {
  public:
-  static SLAppMigrator& of(DataClassMigrator& m) { return static_cast<SLAppMigrator&>(m); }
   // A migrator made without running init (its start-up state stays empty).
   static std::unique_ptr<SLAppMigrator> bare() { return std::unique_ptr<SLAppMigrator>(new SLAppMigrator()); }
   static sl::Dictionary introspect(SLAppMigrator& m, const sl::URL& url, bool* early) {
     return m._introspectContainer(url, early);
   }
-  static sl::Dictionary loadMarker(SLAppMigrator& m, const sl::URL& url) {
-    return m._loadAndValidateMigrationMarkerAtURL(url);
-  }
   static bool migrateContainer(SLAppMigrator& m, const sl::Dictionary& record) {
     return m._migrateContainerWithInfo(record);
-  }
-  static bool hasMissedItems(SLAppMigrator& m, const sl::URL& container, const sl::String& identifier) {
-    return m._containerHasMissedItems(container, identifier);
   }
   static bool migrateSafeHarbors(SLAppMigrator& m) { return m._migrateSafeHarbors(); }
   static bool migrateData(SLAppMigrator& m, const sl::String& identifier, const sl::URL& from, const sl::URL& to) {
@@ -153,10 +146,6 @@ inline std::vector<std::string> hostMessages(const sl::test::LogCapture& log) {
   for (const auto& line : log.host()) out.push_back(line.message);
   return out;
 }
-
-}  // namespace mgtest
-
-namespace mgtest {
 
 // ROOT/private/var/mobile/Applications/NAME.
 inline std::string oldEntry(const std::string& name) { return below(kOldRoot) + "/" + name; }

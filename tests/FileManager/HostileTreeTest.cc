@@ -13,6 +13,7 @@
 #include <filesystem>
 #include <functional>
 #include <thread>
+#include <tuple>
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -217,7 +218,8 @@ TEST(HostileTree, LongOddNamesAndDeepPaths) {
 }
 
 // A tmpfs mounted inside the tree holds the sentinel: the ownership walk
-// does not enter it, and removal fails at the mount point (EBUSY).
+// changes the mount point (an entry of the walk) but does not enter it, and
+// removal fails at the mount point (EBUSY).
 TEST(HostileTree, MountInsideTheTreeIsNotEntered) {
   TempDir tmp(TempDir::kShm);
   const std::string tree = tmp / "tree", mountPoint = tree + "/mnt";
@@ -228,6 +230,11 @@ TEST(HostileTree, MountInsideTheTreeIsNotEntered) {
   writeFile(tree + "/own", "x", 0600);
   LogCapture log;
   EXPECT_TRUE(fm().standardizeOwnershipAtURL(dirURL(tree), kNobody, kNobody, true));
+  struct stat own {}, mounted {};
+  EXPECT_EQ(lstat((tree + "/own").c_str(), &own), 0);
+  EXPECT_EQ(lstat(mountPoint.c_str(), &mounted), 0);
+  EXPECT_EQ(std::tuple(own.st_uid, own.st_gid, own.st_mode & 07777), std::tuple(kNobody, kNobody, 0644u));
+  EXPECT_EQ(std::tuple(mounted.st_uid, mounted.st_gid, mounted.st_mode & 07777), std::tuple(kNobody, kNobody, 0755u));
   sl::Error error;
   EXPECT_FALSE(fm().removeItemAtURL(dirURL(tree), &error));
   EXPECT_TRUE(error.isPOSIX(EBUSY)) << error.description();

@@ -1,7 +1,6 @@
 #include <fcntl.h>
 #include <linux/fs.h>
 #include <sys/ioctl.h>
-#include <sys/mount.h>
 #include <time.h>
 #include <unistd.h>
 
@@ -207,23 +206,6 @@ TEST(TraversalAndOwnership, SwappedItemIsNotChangedThroughALink) {
   EXPECT_TRUE(lines[0].message.starts_with("Failed to realpath " + root + "/d/dangling"));
   EXPECT_EQ(lines[1], installerLine(3, kStandardize, "Could not chown " + root + "/d: Stale file handle"));
   EXPECT_EQ(lines[2], installerLine(3, kStandardize, "Could not chmod " + root + "/d: Stale file handle"));
-}
-
-TEST(TraversalAndOwnership, MountedVolumeIsNotEntered) {
-  TempDir tmp;
-  const std::string root = tmp / "root", mountPoint = root + "/mnt";
-  makeDirs(mountPoint);
-  writeFile(root + "/outer", "", 0600);
-  sl::test::ScopedTmpfs mount(mountPoint);
-  if (!mount.mounted()) GTEST_SKIP() << "cannot mount a tmpfs: " << mount.error();
-  writeFile(mountPoint + "/inner", "", 0600);
-  sl::Error err;
-
-  EXPECT_TRUE(fm().standardizeOwnershipAtURL(fileURL(root, true), kNobody, kNobody, false, &err)) << err.description();
-  EXPECT_EQ(ownerAndMode(root + "/outer"), "65534:65534 644");
-  // The mount point itself is an entry of the walk; what it holds is not.
-  EXPECT_EQ(ownerAndMode(mountPoint), "65534:65534 755");
-  EXPECT_EQ(ownerAndMode(mountPoint + "/inner"), "0:0 600");
 }
 
 }  // namespace

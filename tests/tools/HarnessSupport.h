@@ -84,8 +84,6 @@ class Harness {
   // once or from then on, then reruns cleanly and checks everything.
   Outcome injectAt(const std::string& errnoName, uint64_t k, bool persistent, bool renamesOnly, Tally* tally);
 
-  const std::string& root() const { return root_; }
-
  private:
   struct Step {
     std::string name;
