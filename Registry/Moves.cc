@@ -150,37 +150,44 @@ bool removeIn(const PinnedDirectory& directory, const std::string& name, sl::Err
 // Flushes a rename of `from` into `directory`: that directory, and the one
 // `from` left when it is another.
 bool syncRenamedInto(const PinnedDirectory& directory, const std::string& from, const std::string& to,
-                     sl::Error* error) {
+                     const char* function, sl::Error* error) {
   sl::Error syncError;
   if (sl::syncDirectory(directory.self(), &syncError) &&
       (parentOf(from) == directory.path || sl::syncParentDirectory(from, &syncError))) {
     return true;
   }
   const int code = static_cast<int>(syncError.code());
-  return sl::fail(error, _CreateError(kFunctionName, __LINE__, sl::kPOSIXErrorDomain, code,
+  return sl::fail(error, _CreateError(function, __LINE__, sl::kPOSIXErrorDomain, code,
                                       "rename of %s to %s is not durable: %s", from, to, strerror(code)));
 }
 
 // Copies `from` to ".NAME<suffix>" in `directory`, flushes the copy, then
-// renames it to NAME there.
+// renames it to NAME there; records name `function`. A copy that fails on the way is removed again
+// (as far as the failure allows: what stays is removed by the next attempt,
+// before it copies), so that a failed call leaves `directory` as it found it.
 bool copyThenRename(const std::string& from, const PinnedDirectory& directory, const std::string& name,
-                    const char* suffix, sl::Error* error) {
+                    const char* suffix, const char* function, sl::Error* error) {
   const std::string temporaryName = "." + name + suffix;
   const std::string temporary = directory.shown(temporaryName);
   if (!removeIn(directory, temporaryName, error)) return false;
+  auto failed = [&](int code, const char* call, const std::string& source, const std::string& target) {
+    sl::Error ignored;  // the failure reported is the one that matters
+    removeIn(directory, temporaryName, &ignored);
+    return posixFailure(error, code, call, source, target, function);
+  };
   if (sl::copyfile(from.c_str(), directory.at(temporaryName).c_str(), nullptr, kCopyFlags) != 0) {
     const int copyErrno = errno;
-    return posixFailure(error, copyErrno, "copyfile", from, temporary);
+    return failed(copyErrno, "copyfile", from, temporary);
   }
   sl::Error syncError;
   if (!sl::syncTree(directory.at(temporaryName), &syncError)) {
-    return posixFailure(error, static_cast<int>(syncError.code()), "fsync of the copy", from, temporary);
+    return failed(static_cast<int>(syncError.code()), "fsync of the copy", from, temporary);
   }
   if (sl::mut::renameat(directory.fd.get(), temporaryName.c_str(), directory.fd.get(), name.c_str()) != 0) {
     const int renameErrno = errno;
-    return posixFailure(error, renameErrno, "rename", temporary, directory.shown(name));
+    return failed(renameErrno, "rename", temporary, directory.shown(name));
   }
-  return syncRenamedInto(directory, temporary, directory.shown(name), error);
+  return syncRenamedInto(directory, temporary, directory.shown(name), function, error);
 }
 
 }  // namespace
@@ -205,7 +212,7 @@ bool moveIntoContainer(const Move& move, sl::Error* error) {
     return openFailure(error, openErrno, containerPath, kFunctionName);
   }
   const PinnedDirectory container{std::move(containerFd), containerPath};
-  if (!copyThenRename(move.source, container, nameOf(move.destination), ".partial", error)) return false;
+  if (!copyThenRename(move.source, container, nameOf(move.destination), ".partial", kFunctionName, error)) return false;
   // The source leaves whole or not at all: renamed away first, then removed.
   const std::string trash = trashPathFor(move.source);
   if (!removeTree(trash, error)) return false;
@@ -238,13 +245,13 @@ bool undoMove(const Move& move, const std::string& packagePath, sl::Error* error
   const bool sourcePresent = ::fstatat(directory.fd.get(), name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0;
   if (!sourcePresent && present(move.destination)) {
     if (sl::mut::renameat(AT_FDCWD, move.destination.c_str(), directory.fd.get(), name.c_str()) == 0) {
-      if (!syncRenamedInto(directory, move.destination, move.source, error)) return false;
+      if (!syncRenamedInto(directory, move.destination, move.source, kUndoFunctionName, error)) return false;
     } else {
       const int renameErrno = errno;
       if (renameErrno != EXDEV) {
         return posixFailure(error, renameErrno, "rename", move.destination, move.source, kUndoFunctionName);
       }
-      if (!copyThenRename(move.destination, directory, name, ".rgrestore", error)) return false;
+      if (!copyThenRename(move.destination, directory, name, ".rgrestore", kUndoFunctionName, error)) return false;
     }
   }
   return removeIn(directory, trashNameOf(move.source), error);

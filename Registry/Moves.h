@@ -20,13 +20,14 @@ std::string trashPathFor(const std::string& source);
 // Renames the source to the destination; across volumes (EXDEV) copies it
 // to ".NAME.partial" in the destination's directory, renames that into
 // place, renames the source to its trash name and removes the trash. Each
-// step counts for the crash seam.
+// step counts for the crash seam. A copy that fails is removed again, so
+// the call fails with the container as it was.
 bool moveIntoContainer(const Move& move, sl::Error* error);
 
 // Brings the source back when it is gone and the destination is there
 // (rename, or across volumes a copy to ".NAME.rgrestore" beside the source
-// renamed into place), then removes the trash. A source that is there is
-// whole and is left alone. The destination's container is not removed here.
+// renamed into place; removed again when the copy fails), then removes the
+// trash. A source that is there is whole and is left alone. The destination's container is not removed here.
 //
 // The package (`packagePath`, the install's package directory) belongs to
 // someone else and may have changed since the install: every step on the

@@ -18,6 +18,7 @@
 #include "Platform/Bundle.h"
 #include "Platform/Mutations.h"
 #include "Registry/Database.h"
+#include "Registry/Moves.h"
 #include "Registry/RegistryTestSupport.h"
 #include "TestSupport/Sentinel.h"
 
@@ -242,6 +243,45 @@ TEST(RegistryCrashTest, RecoveryFollowsNoLinkPlantedInThePackage) {
       EXPECT_EQ(entries(made), std::vector<std::string>{}) << made;
     }
   }
+}
+
+// A copy across volumes that fails half-way (its second file's write) is
+// removed again, on the way into the container and on the way back, and
+// the call's record says which way; the next attempt then finishes.
+TEST(RegistryCrashTest, FailedCopiesAcrossVolumesLeaveNothingBehind) {
+  if (!sl::mut::kFaultInjectionBuilt) GTEST_SKIP() << "a build without fault plans";
+  sl::test::TempDir shm(sl::test::TempDir::kShm), disk;
+  if (sameVolume(shm.path(), disk.path())) GTEST_SKIP() << "/dev/shm and the temporary directory share a volume";
+  const std::string package = disk / "Staging";
+  const rg::Move move{makeCustomerPackage(package, "com.example.far"), shm / "Container/App.app"};
+  sl::test::makeDirs(shm / "Container");
+  auto failOnce = [](const char* plan) { ASSERT_TRUE(sl::mut::setPlanForTesting(plan)); };
+  sl::Error error;
+
+  failOnce("EIO@2:write");
+  EXPECT_FALSE(rg::moveIntoContainer(move, &error));
+  sl::test::expectPOSIXRecord(error, EIO,
+                              "copyfile of " + move.source + " to " + shm / "Container/.App.app.partial" +
+                                  " failed: Input/output error",
+                              "rg::moveIntoContainer");
+  EXPECT_EQ(entries(shm / "Container"), std::vector<std::string>{});
+  EXPECT_TRUE(bundleReadable(move.source));
+  failOnce("");
+  ASSERT_TRUE(rg::moveIntoContainer(move, &error)) << error.description();
+  EXPECT_EQ(entries(package + "/Payload"), std::vector<std::string>{});
+
+  failOnce("EIO@2:write");
+  EXPECT_FALSE(rg::undoMove(move, package, &error));
+  sl::test::expectPOSIXRecord(error, EIO,
+                              "copyfile of " + move.destination + " to " + package + "/Payload/.App.app.rgrestore" +
+                                  " failed: Input/output error",
+                              "rg::undoMove");
+  EXPECT_EQ(entries(package + "/Payload"), std::vector<std::string>{});
+  EXPECT_TRUE(bundleReadable(move.destination));
+  failOnce("");
+  ASSERT_TRUE(rg::undoMove(move, package, &error)) << error.description();
+  EXPECT_EQ(entries(package + "/Payload"), std::vector<std::string>{move.source});
+  EXPECT_EQ(sl::test::readFile(move.source + "/Executable"), "binary of com.example.far");
 }
 
 }  // namespace
