@@ -111,6 +111,7 @@ struct Deferred {
     dev_t device;
     UniqueFd fd;
     std::string path;
+    bool onlyRemovals;  // nothing noted here but syncDirectoryAfterRemoval
   };
   int depth = 0;
   int contentDepth = 0;  // scopes that defer the content of scratch files too
@@ -120,16 +121,18 @@ thread_local Deferred tDeferred;
 
 // Flushes the directory open as `fd`, or notes its file system while
 // flushes are deferred.
-bool syncOpenDirectory(int fd, const std::string& path, Error* error) {
+bool syncOpenDirectory(int fd, const std::string& path, Error* error, bool afterRemoval = false) {
   if (tDeferred.depth == 0) return syncDescriptor(fd, path, error);
   struct stat st;
   if (::fstat(fd, &st) != 0) return failStep(error, errno, "fstat", path);
-  for (const Deferred::FileSystem& noted : tDeferred.pending) {
-    if (noted.device == st.st_dev) return true;
+  for (Deferred::FileSystem& noted : tDeferred.pending) {
+    if (noted.device != st.st_dev) continue;
+    noted.onlyRemovals = noted.onlyRemovals && afterRemoval;
+    return true;
   }
   UniqueFd copy(::fcntl(fd, F_DUPFD_CLOEXEC, 0));
   if (!copy) return failStep(error, errno, "dup", path);
-  tDeferred.pending.push_back({st.st_dev, std::move(copy), path});
+  tDeferred.pending.push_back({st.st_dev, std::move(copy), path, afterRemoval});
   return true;
 }
 
@@ -157,7 +160,12 @@ bool flushDeferredSyncs(Error* error) {
   return true;
 }
 
-bool deferredSyncsPending() { return !tDeferred.pending.empty(); }
+bool deferredSyncsPending(Pending which) {
+  for (const Deferred::FileSystem& noted : tDeferred.pending) {
+    if (which == Pending::kAny || !noted.onlyRemovals) return true;
+  }
+  return false;
+}
 
 bool writeFileAtomically(const URL& url, std::span<const uint8_t> bytes, mode_t mode, Error* error) {
   const std::string& path = url.path();
@@ -224,6 +232,10 @@ bool syncDirectory(const std::string& path, Error* error) {
   UniqueFd fd(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!fd) return failStep(error, errno, "open", path);
   return syncOpenDirectory(fd.get(), path, error);
+}
+
+bool syncDirectoryAfterRemoval(int directoryFd, const std::string& path, Error* error) {
+  return syncOpenDirectory(directoryFd, path, error, true);
 }
 
 bool syncParentDirectory(const std::string& path, Error* error) {

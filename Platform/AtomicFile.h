@@ -64,7 +64,8 @@ bool syncTree(const std::string& path, Error* error = nullptr);
 // so far: data, names and attributes.
 //
 // What depends on a deferred change flushes first: removefile before it
-// removes anything but an empty directory, the registry before it commits.
+// removes anything but an empty directory (earlier removals excepted), the
+// registry before it commits.
 // A failed flush keeps its file systems noted, so whatever depends on it
 // fails too, and reports "syncfs of <path> failed: <strerror>" (the first
 // directory noted on that file system). syncTree is never deferred.
@@ -89,9 +90,17 @@ class DeferredSyncs {
   What what_;
 };
 
+// syncDirectory for the directory open for reading as `directoryFd`
+// (`path` names it in records), after names were removed from it and
+// nothing else changed there. Deferred, it is what no removal waits for:
+// removals may reach the disk in any order among themselves.
+bool syncDirectoryAfterRemoval(int directoryFd, const std::string& path, Error* error = nullptr);
+
 // Flushes what this thread has deferred; true when nothing was.
 bool flushDeferredSyncs(Error* error = nullptr);
-// True when this thread has deferred a flush that has not been made yet.
-bool deferredSyncsPending();
+// True when this thread has deferred a flush that has not been made yet:
+// any, or one of a change besides the removals (what a removal waits for).
+enum class Pending { kAny, kBesidesRemovals };
+bool deferredSyncsPending(Pending which = Pending::kAny);
 
 }  // namespace sl

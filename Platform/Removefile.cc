@@ -628,6 +628,27 @@ bool isEmptyDirectory(int parentFd, const std::string& name, Kind kind) {
   return true;
 }
 
+// Makes a removal durable before what it freed can be used again. On a
+// file system without a journal, a name that outlived a power cut would
+// lead to an inode that is by then another file's, and the repair would
+// make the two one (a removed container back, holding a newer file). A
+// removed item's parent is flushed (noted only while flushes are
+// deferred); a tree removed in part, whose changed directories may be
+// anywhere in it, has its file system flushed. Returns 0 or the flush's
+// errno. A parent the caller may not read cannot be flushed on Linux and
+// is left as it stands.
+int flushRemoval(int parentFd, const std::string& name, const std::string& topPath, Kind kind) {
+  Error error;
+  struct stat st;
+  if (fstatat(parentFd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0 && errno == ENOENT) {
+    UniqueFd parent(openat(parentFd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!parent) return errno == EACCES ? 0 : errno;
+    return syncDirectoryAfterRemoval(parent.get(), topPath, &error) ? 0 : static_cast<int>(error.code());
+  }
+  if (kind != Kind::kDirectory) return 0;
+  return syncTree(topPath, &error) ? 0 : static_cast<int>(error.code());
+}
+
 }  // namespace
 
 removefile_state_t removefile_state_alloc() {
@@ -695,7 +716,7 @@ int removefile(const char* path, removefile_state_t state, removefile_flags_t fl
   }
   // What this thread deferred (renames out of this very tree, say) reaches
   // the disk before anything here goes.
-  if (deferredSyncsPending() && !isEmptyDirectory(parentFd.get(), name, kind)) {
+  if (deferredSyncsPending(Pending::kBesidesRemovals) && !isEmptyDirectory(parentFd.get(), name, kind)) {
     Error flushError;
     if (!flushDeferredSyncs(&flushError)) {
       errno = static_cast<int>(flushError.code());
@@ -706,9 +727,16 @@ int removefile(const char* path, removefile_state_t state, removefile_flags_t fl
   int err;
   {
     Shared shared(state, (flags & REMOVEFILE_RECURSIVE) != 0);
-    Walk(shared, parentFd.get(), std::move(name), std::move(topPath), 0, nullptr).run(kind);
+    Walk(shared, parentFd.get(), name, topPath, 0, nullptr).run(kind);
     result = shared.finish();
     err = errno;
+  }
+  // A failed removal keeps its own errno; a flush that fails after one
+  // that succeeded is the call's failure.
+  const int flushErrno = flushRemoval(parentFd.get(), name, topPath, kind);
+  if (result == 0 && flushErrno != 0) {
+    result = -1;
+    err = flushErrno;
   }
   // Closing descriptors and freeing memory keep errno, but the caller must
   // read the errno of the failure whatever they do.

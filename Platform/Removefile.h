@@ -22,9 +22,16 @@
 //  - A path where nothing stands fails with -1 and ENOENT, without a
 //    callback. Otherwise the result is 0 when the walk reached its end.
 //  - Flushes this thread has deferred (DeferredSyncs, AtomicFile.h) are made
-//    before anything but an empty directory is removed; when that fails,
+//    before anything but an empty directory is removed, unless they are
+//    only those of earlier removals; when that fails,
 //    nothing is removed and the call fails with -1 and the flush's errno,
 //    without a callback.
+//  - What it removed is made durable before it returns, so that nothing
+//    reuses the freed inodes first: the parent of a removed item is flushed
+//    (only noted while flushes are deferred), the file system of a tree
+//    removed in part is flushed. A flush that fails after a whole removal
+//    fails the call with -1 and its errno, without a callback; a parent the
+//    caller cannot read is not flushed.
 #pragma once
 
 #include <cstdint>

@@ -109,6 +109,7 @@ TEST(AtomicFileTest, DeferredFlushesWaitForWhatDependsOnThem) {
   TempDir disk, shm(TempDir::kShm);
   test::writeFile(disk / "old", "old");
   test::writeFile(disk / "doomed", "x");
+  test::writeFile(disk / "second", "x");
   ASSERT_EQ(mkdir((disk / "empty").c_str(), 0755), 0);
   auto syncs = [](const char* plan = "EIO@1000:sync") { ASSERT_TRUE(mut::setPlanForTesting(plan)); };
   Error error;
@@ -156,13 +157,16 @@ TEST(AtomicFileTest, DeferredFlushesWaitForWhatDependsOnThem) {
     syncs();
     ASSERT_EQ(removefile((disk / "doomed").c_str(), nullptr, 0), 0);
     EXPECT_EQ(mut::matchedCount(), 2u) << "one syncfs for each file system";
-    EXPECT_FALSE(deferredSyncsPending());
+    EXPECT_TRUE(deferredSyncsPending()) << "the removal's own flush waits too";
+    EXPECT_FALSE(deferredSyncsPending(Pending::kBesidesRemovals));
+    ASSERT_EQ(removefile((disk / "second").c_str(), nullptr, 0), 0);
+    EXPECT_EQ(mut::matchedCount(), 2u) << "a removal does not wait for another";
     EXPECT_TRUE(flushDeferredSyncs(&error));
-    EXPECT_EQ(mut::matchedCount(), 2u);
+    EXPECT_EQ(mut::matchedCount(), 3u);
 
     ASSERT_TRUE(syncDirectory(shm.path()));
   }
-  EXPECT_EQ(mut::matchedCount(), 3u) << "the outermost scope flushes what is left";
+  EXPECT_EQ(mut::matchedCount(), 4u) << "the outermost scope flushes what is left";
   EXPECT_FALSE(deferredSyncsPending());
   EXPECT_EQ(readFile(disk / "new"), "new");
   EXPECT_EQ(readFile(disk / "scratch"), "s");

@@ -16,6 +16,7 @@
 #include <tuple>
 #include <vector>
 
+#include "Platform/Mutations.h"
 #include "Platform/UniqueFd.h"
 #include "TestSupport/TestSupport.h"
 
@@ -153,6 +154,37 @@ TEST(Removefile, FailingEntriesAreReported) {
   }
   for (const char* gone : {"/a/file", "/b", "/empty-locked"}) EXPECT_FALSE(exists(top + gone)) << gone;
   EXPECT_TRUE(exists(top + "/a/locked/f"));
+}
+
+// What a removal freed is on disk when it returns: the parent's entries
+// after a whole removal, the file system after one in part. A flush that
+// fails fails a removal that had succeeded (which stands).
+TEST(Removefile, RemovalsAreDurableWhenTheyReturn) {
+  if (!sl::mut::kFaultInjectionBuilt) GTEST_SKIP() << "a build without fault plans";
+  sl::test::TempDir dir;
+  ASSERT_EQ(chown(dir.path().c_str(), sl::test::ScopedUnprivileged::kUid, sl::test::ScopedUnprivileged::kGid), 0);
+  sl::test::ScopedUnprivileged nobody;
+  writeFile(dir / "tree/a/f");
+  writeFile(dir / "file");
+  writeFile(dir / "part/locked/f");
+  writeFile(dir / "part/free");
+  ASSERT_EQ(chmod((dir / "part/locked").c_str(), 0), 0);
+  auto syncs = [](const char* plan) { ASSERT_TRUE(sl::mut::setPlanForTesting(plan)); };
+
+  syncs("EIO@1000:sync");
+  EXPECT_EQ(removeWith(dir / "tree"), (Outcome{0, 0, {}}));
+  EXPECT_EQ(sl::mut::matchedCount(), 1u);
+  EXPECT_EQ(removeWith(dir / "part", sl::REMOVEFILE_STOP), (Outcome{-1, EACCES, {{dir / "part/locked", EACCES}}}));
+  EXPECT_EQ(sl::mut::matchedCount(), 2u);
+
+  syncs("EIO@1:sync");
+  EXPECT_EQ(removeWith(dir / "file"), (Outcome{-1, EIO, {}}));
+  EXPECT_FALSE(exists(dir / "file"));
+  syncs("EIO@1:sync");
+  EXPECT_EQ(removeWith(dir / "part"), (Outcome{-1, EIO, {{dir / "part/locked", EACCES}, {dir / "part", ENOTEMPTY}}}));
+  EXPECT_FALSE(exists(dir / "part/free"));
+  syncs("");
+  ASSERT_EQ(chmod((dir / "part/locked").c_str(), 0755), 0);
 }
 
 TEST(Removefile, TreeChangedDuringTheWalk) {
