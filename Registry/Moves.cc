@@ -162,9 +162,10 @@ bool syncRenamedInto(const PinnedDirectory& directory, const std::string& from, 
 }
 
 // Copies `from` to ".NAME<suffix>" in `directory`, flushes the copy, then
-// renames it to NAME there; records name `function`. A copy that fails on the way is removed again
-// (as far as the failure allows: what stays is removed by the next attempt,
-// before it copies), so that a failed call leaves `directory` as it found it.
+// renames it to NAME there; records name `function`. A copy that fails on
+// the way is removed again (as far as the failure allows: what stays is
+// removed by the next attempt, before it copies), so that a failed call
+// leaves `directory` as it found it.
 bool copyThenRename(const std::string& from, const PinnedDirectory& directory, const std::string& name,
                     const char* suffix, const char* function, sl::Error* error) {
   const std::string temporaryName = "." + name + suffix;

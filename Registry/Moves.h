@@ -27,7 +27,8 @@ bool moveIntoContainer(const Move& move, sl::Error* error);
 // Brings the source back when it is gone and the destination is there
 // (rename, or across volumes a copy to ".NAME.rgrestore" beside the source
 // renamed into place; removed again when the copy fails), then removes the
-// trash. A source that is there is whole and is left alone. The destination's container is not removed here.
+// trash. A source that is there is whole and is left alone. The
+// destination's container is not removed here.
 //
 // The package (`packagePath`, the install's package directory) belongs to
 // someone else and may have changed since the install: every step on the
